@@ -1,0 +1,41 @@
+// Copying the run options of a configuration into the controller.
+#include <stdlib.h>
+#include <string.h>
+
+#include "common/io_util.h"
+#include "common/wlog.h"
+#include "config/config_store.h"
+#include "core/log_controller.h"
+#include "storage/history_log.h"
+
+void LogController::load_boot_options(ConfigCache& config) {
+    autostart = logsize = totallogsize = 0;
+    sd_log_path = 1;
+    log_file_num = 0;
+    memset(logpath, 0, sizeof(logpath));
+    // android_log, kernel_log and bt_log keep their value when the key is missing.
+
+    const char* value;
+    if ((value = config_get(&config, "autostart"))) autostart = atoi(value);
+    if ((value = config_get(&config, "logpath"))) {
+        copy_str(logpath, sizeof(logpath), value);
+        if (strcmp(logpath, "/data") == 0) sd_log_path = 0;
+    }
+    if ((value = config_get(&config, "logsize"))) logsize = atoi(value);
+    if ((value = config_get(&config, "totallogsize"))) totallogsize = atoi(value);
+    if ((value = config_get(&config, "AndroidLog"))) {
+        android_log = atoi(value);
+        if (android_log) log_file_num += 15;
+    }
+    if ((value = config_get(&config, "KernelLog"))) {
+        kernel_log = atoi(value);
+        if (kernel_log) log_file_num += 5;
+    }
+    WLOG(TAG_MAIN, WLOG_DEBUG, "have qrvbt");
+    if ((value = config_get(&config, "BTLog"))) {
+        bt_log = atoi(value);
+        if (bt_log) log_file_num += 5;
+    }
+    HLOG(TAG_MAIN, WLOG_INFO, "boot:%d,path:%s,size:%d,Tsize:%d,A:%d,K:%d,B:%d", autostart, logpath,
+         logsize, totallogsize, android_log, kernel_log, bt_log);
+}

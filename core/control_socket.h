@@ -1,0 +1,13 @@
+// The control socket "tavlologd", its thread and the text command protocol.
+#pragma once
+
+class LogController;
+
+#define CONTROL_SOCKET_NAME "tavlologd"
+
+void start_control_socket(LogController* controller);
+void control_loop(LogController* controller);
+int handle_client_message(LogController* controller, int fd);
+// Writes text to the client fd, or to every connected client when fd is -1.
+void reply_client(LogController* controller, int fd, const char* text);
+void apply_config_message(LogController* controller, char* text);

@@ -1,0 +1,76 @@
+// The daemon's one controller: run options, paths, collector pids, the control
+// clients and the flags that tie the boot paths, commands and supervision together.
+#pragma once
+
+#include <netinet/in.h>
+#include <pthread.h>
+#include <semaphore.h>
+#include <stdint.h>
+#include <sys/types.h>
+
+#include "common/limits.h"
+
+struct ConfigCache;
+struct ControlBlock;
+
+constexpr int MAX_CLIENTS = 10;
+
+struct ClientSlot {
+    int fd;                 // -1 when the slot is free
+    unsigned char addr[16];  // peer address from accept, kept and cleared with the slot
+};
+
+class LogController {
+  public:
+    LogController();
+    virtual ~LogController();
+
+    void load_boot_options(ConfigCache& config);
+    // The path whose file system the transist's writer checks for free space.
+    const char* current_log_root() const;
+
+    ControlBlock* shm = nullptr;
+    sem_t* sem = nullptr;
+    uint8_t boot_copy_timer = 0;
+    int android_log = 0;
+    int kernel_log = 0;
+    int bt_log = 0;
+    int listen_fd = 0;
+    int warned = 0;
+    // -1 nothing known, 0 a temporary folder in /data, 1 a folder under the log path.
+    int log_path_state = -1;
+    pthread_mutex_t client_lock;  // guards clients; taken before reply_lock
+    pthread_mutex_t reply_lock;   // serialises every write to clients
+    pid_t klog_pid = 0;
+    pid_t mlog_pid = 0;
+    pid_t rlog_pid = 0;
+    pid_t elog_pid = 0;
+    pid_t blog_pid = 0;
+    int autostart = 0;
+    int logsize = 0;
+    int totallogsize = 0;
+    int sd_log_path = 1;
+    int rotate_size_kb = 0;
+    int log_file_num = 0;
+    char logpath[PATH_LEN] = {};
+    char run_folder[PATH_LEN] = {};
+    int boot_mode = 0;
+    ClientSlot clients[MAX_CLIENTS];
+};
+
+// Non-blocking event counters: a collector ended (SIGCHLD), and the transist's
+// writer gave up (1001 storage low, 1002 log folder lost).
+extern int efd_chld;
+extern int efd_thread;
+// Descriptor of the current run's shared control block; closed at stop.
+extern int shm_fd;
+// 1 when the temporary-folder start found /data too full.
+extern int data_storage_low;
+
+// "1" while a logging run is active; the one record of the running state.
+#define PROP_RUNNING "debug.TQ.running"
+#define PROP_REALPATH "debug.TQ.realpath"
+#define PROP_LOGSIZE "debug.TQ.logsize"
+
+// atoi of debug.TQ.running (default "0") is not 0.
+bool is_running();

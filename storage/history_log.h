@@ -1,0 +1,19 @@
+// The daemon's diary: timestamped one-line records in /data/misc/tqlog/tqlog_history
+// and in the current run folder's tqlog_history.
+#pragma once
+
+// level 0: central file only; 1: run file, or the central file when no run
+// folder is set; 2: both; any other level: nothing.
+void history_log(int level, const char* format, ...) __attribute__((format(printf, 2, 3)));
+
+// Copies debug.TQ.realpath into out (at least 255 bytes) and returns out, or
+// returns nullptr when the property is empty.
+char* get_run_folder(char* out);
+
+// mkdir -p with mode 0775. Returns 1 when the final mkdir succeeded, 0 otherwise
+// (an existing path counts as failure).
+int make_dir_recursive(const char* path);
+
+// Called in a freshly forked child: the history lock may have been held by
+// another thread of the parent at the fork.
+void history_log_after_fork();
