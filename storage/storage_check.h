@@ -13,5 +13,9 @@ uint64_t get_free_space(const char* path, int retries);
 // measured), else 0.
 int is_storage_low(const char* path);
 
+// The threshold of is_storage_low on a measured amount: 1 when free_bytes is
+// below LOW_STORAGE_BYTES.
+int is_free_space_low(uint64_t free_bytes);
+
 // Records a warning of the given type; negative types are ignored.
 void report_system_warning(int type);
