@@ -1,0 +1,49 @@
+#include "config/log_path.h"
+
+#include <string.h>
+
+#include "common/io_util.h"
+#include "common/wlog.h"
+#include "config/config_store.h"
+#include "platform/properties.h"
+#include "storage/history_log.h"
+
+namespace {
+
+// Directory of a storage from its property, or the fixed fallback when the
+// property is unset. Properties are read afresh: the storage may be remounted.
+void storage_dir(const char* property, const char* fallback, char* out) {
+    char dir[PROPERTY_VALUE_MAX];
+    property_get(property, dir, "");
+    if (dir[0] == '\0') {
+        HLOG(TAG_CONFIG, WLOG_ERROR, "cant get log path through property %s", property);
+        copy_str(out, CONFIG_FIELD_LEN, fallback);
+    } else {
+        copy_str(out, CONFIG_FIELD_LEN, dir);
+    }
+}
+
+}  // namespace
+
+const char* resolve_log_path(const char* value, char* out) {
+    if (value == nullptr) value = "";
+    if (strcmp(value, "internal_sd") == 0) {
+        storage_dir("internal_sd_path", "/mnt/sdcard", out);
+    } else if (strcmp(value, "external_sd") == 0) {
+        storage_dir("external_sd_path", "/mnt/sdcard2", out);
+    } else {
+        copy_str(out, CONFIG_FIELD_LEN, value);
+    }
+    WLOG(TAG_CONFIG, WLOG_DEBUG, "correct log path is %s", out);
+    return out;
+}
+
+void apply_log_path_override(ConfigCache* cache) {
+    char override_path[PROPERTY_VALUE_MAX];
+    property_get("persist.qrvlog.log2sd.path", override_path, "");
+    if (override_path[0] == '\0') return;
+    // config_update_item reports 0 when the value is already the stored one.
+    if (config_update_item(cache, "logpath", override_path) == 0) return;
+    WLOG(TAG_CONFIG, WLOG_DEBUG, "new log path is %s", override_path);
+    config_write(cache);
+}
