@@ -1,3 +1,35 @@
 // Entry of tavlo_log_d: drop privileges, record the start, read the boot mode,
 // build the controller and hand over to the boot path.
-int main() { return 0; }
+#include <signal.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include "common/wlog.h"
+#include "core/boot_mode.h"
+#include "core/boot_start.h"
+#include "core/log_controller.h"
+#include "core/privileges.h"
+#include "storage/history_log.h"
+
+int main() {
+    // A client or collector that has gone must give EPIPE, not end the daemon.
+    signal(SIGPIPE, SIG_IGN);
+
+    if (getuid() != 0) {
+        HLOG(TAG_DEBUG, WLOG_INFO, "[== First Log ==] tavlo_log_d is not in root user");
+    } else {
+        drop_privileges();
+    }
+
+    history_log(0, "****** TQLOG START *******");
+    WLOG(TAG_DEBUG, WLOG_INFO, "****** TQLOG START *******");
+
+    // Every file and folder gets exactly the mode it is created with.
+    umask(0);
+    int mode = read_boot_mode();
+
+    LogController* controller = new LogController();
+    boot_start(controller, mode);
+
+    for (;;) sleep(2000);
+}
