@@ -14,9 +14,19 @@ int read_boot_mode(const char* path) {
         HLOG(TAG_DEBUG, WLOG_ERROR, "Failed to open boot mode file %s", path);
         return -1;
     }
-    // Only the first character counts: "10" is boot mode 1.
-    char buf[2] = {0, 0};
-    if (RETRY_EINTR(read(fd, buf, 1)) < 0) buf[0] = 0;
+    // Only the first character counts: "10" is boot mode 1. A little more is read
+    // so that odd content can be recorded.
+    char content[8] = {};
+    ssize_t n = RETRY_EINTR(read(fd, content, sizeof(content)));
     close(fd);
-    return atoi(buf);
+    if (n < 0) n = 0;
+    char buf[2] = {content[0], 0};
+    int mode = atoi(buf);
+    bool one_digit = n >= 1 && content[0] >= '0' && content[0] <= '9' &&
+                     (n == 1 || content[1] == '\n');
+    if (!one_digit) {
+        HLOG(TAG_DEBUG, WLOG_WARN, "boot mode file %s holds %zd odd byte(s), boot mode %d", path, n,
+             mode);
+    }
+    return mode;
 }

@@ -39,7 +39,21 @@ INSTANTIATE_TEST_SUITE_P(Contents, BootModeFile,
                                            BootModeCase{"10", 1}, BootModeCase{"7", 7},
                                            BootModeCase{"x", 0}, BootModeCase{"", 0},
                                            BootModeCase{"-3", 0},
-                                           BootModeCase{"\xff\xfe binary", 0}));
+                                           BootModeCase{"\xff\xfe binary", 0}),
+                         [](const ::testing::TestParamInfo<BootModeCase>& info) {
+                             return "case" + std::to_string(info.index);
+                         });
+
+TEST(BootMode, OddContentIsRecorded) {
+    FILE* f = fopen("/tmp/boot_mode_odd", "w");
+    ASSERT_NE(f, nullptr);
+    fputs("10", f);
+    fclose(f);
+    EXPECT_EQ(read_boot_mode("/tmp/boot_mode_odd"), 1);
+    std::string history = read_all("/data/misc/tqlog/tqlog_history");
+    EXPECT_NE(history.find("boot mode file /tmp/boot_mode_odd holds 2 odd byte(s), boot mode 1"),
+              std::string::npos);
+}
 
 TEST(BootMode, MissingFileIsMinusOneAndRecorded) {
     EXPECT_EQ(read_boot_mode("/tmp/no/such/boot_mode"), -1);
