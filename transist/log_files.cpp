@@ -1,0 +1,216 @@
+// Output files of a logging run.
+#include "transist/log_files.h"
+
+#include <errno.h>
+#include <fcntl.h>
+#include <limits.h>
+#include <stdio.h>
+#include <string.h>
+#include <unistd.h>
+
+#include "common/io_util.h"
+#include "common/wlog.h"
+#include "core/log_controller.h"
+#include "platform/properties.h"
+#include "storage/history_log.h"
+#include "transist/transist_queue.h"
+#include "transist/transist_state.h"
+
+static const char HEADER_PREFIX[] = "-----timezone: ";
+
+// One record per file for failed data writes: a full disk fails every node.
+static bool write_failure_recorded[LOG_TYPE_COUNT];
+
+static int type_of(const LogFile* entry) { return static_cast<int>(entry - log_files); }
+
+int format_header(char* out, size_t n, const char* timezone) {
+    static std::atomic<bool> cut_recorded{false};
+    const int prefix_len = static_cast<int>(sizeof(HEADER_PREFIX)) - 1;
+    const int zone_max = HEADER_MAX - prefix_len - 1;  // room left for the line feed
+    int zone_len = static_cast<int>(strnlen(timezone, PROPERTY_VALUE_MAX));
+    if (zone_len > zone_max) {
+        if (!cut_recorded.exchange(true)) {
+            char shown[PROPERTY_VALUE_MAX];
+            printable_copy(shown, sizeof(shown), timezone);
+            HLOG(TAG_TRANSIST, WLOG_WARN, "timezone %s too long, cut to %d characters", shown,
+                 zone_max);
+        }
+        zone_len = zone_max;
+    }
+    char zone[HEADER_MAX];
+    memcpy(zone, timezone, static_cast<size_t>(zone_len));
+    zone[zone_len] = '\0';
+    // A line feed inside the zone would split the header line.
+    for (int i = 0; i < zone_len; i++) {
+        unsigned char c = static_cast<unsigned char>(zone[i]);
+        if (c < 0x20 || c == 0x7f) zone[i] = '?';
+    }
+    int len = snprintf(out, n, "%s%s\n", HEADER_PREFIX, zone);
+    if (len < 0) return 0;
+    return len < static_cast<int>(n) ? len : static_cast<int>(n) - 1;
+}
+
+int open_log_file(const char* path) {
+    // O_CLOEXEC keeps the files out of the shell commands the daemon runs; the
+    // forked collectors close their copies themselves.
+    int fd = RETRY_EINTR(open(path, O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0600));
+    if (fd < 0) return fd;
+    if (fd == 0) {
+        // Descriptor 0 counts as "no file" in the table; move it out of the way.
+        int moved = fcntl(fd, F_DUPFD_CLOEXEC, 3);
+        int saved = errno;
+        close(fd);
+        if (moved < 0) {
+            errno = saved;
+            return -1;
+        }
+        fd = moved;
+    }
+    char zone[PROPERTY_VALUE_MAX];
+    property_get("persist.sys.timezone", zone, "GMT");
+    char header[HEADER_MAX + 1];
+    int len = format_header(header, sizeof(header), zone);
+    if (write_fully(fd, header, static_cast<size_t>(len)) != len) {
+        int err = errno;
+        HLOG(TAG_TRANSIST, WLOG_ERROR, "write %s fail,%s(%d)", path, strerror(err), err);
+    }
+    RETRY_EINTR(fsync(fd));
+    return fd;
+}
+
+int compose_log_name(char* out, const char* folder, int type) {
+    int len = snprintf(out, PATH_LEN, "%s%s", folder, log_type_name(type));
+    if (len < 0 || len >= PATH_LEN) {
+        out[0] = '\0';
+        return 0;
+    }
+    return 1;
+}
+
+void open_output_files(LogController* controller, const char* run_folder) {
+    bool enabled[LOG_TYPE_COUNT] = {controller->android_log != 0, controller->android_log != 0,
+                                    controller->android_log != 0, controller->kernel_log != 0,
+                                    controller->bt_log != 0};
+    pthread_mutex_lock(&file_table_lock);
+    for (int type = 0; type < LOG_TYPE_COUNT; type++) {
+        log_files[type].fd = -1;
+        log_files[type].size = 0;
+        log_files[type].name[0] = '\0';
+        write_failure_recorded[type] = false;
+    }
+    for (int type = 0; type < LOG_TYPE_COUNT; type++) {
+        if (!enabled[type]) continue;
+        LogFile* entry = &log_files[type];
+        if (!compose_log_name(entry->name, run_folder, type)) {
+            HLOG(TAG_TRANSIST, WLOG_ERROR, "log file path too long: %.200s... + %s", run_folder,
+                 log_type_name(type));
+            continue;
+        }
+        entry->fd = open_log_file(entry->name);
+        if (entry->fd < 0) {
+            int err = errno;
+            if (type == LOG_BT) {
+                HLOG(TAG_TRANSIST, WLOG_ERROR, "Create %s fail, %s", entry->name, strerror(err));
+            } else {
+                HLOG(TAG_TRANSIST, WLOG_ERROR, "Create %s fail %s", entry->name, strerror(err));
+            }
+        }
+        HLOG(TAG_TRANSIST, WLOG_INFO, "open %s, fd = %d", entry->name, entry->fd);
+    }
+    pthread_mutex_unlock(&file_table_lock);
+}
+
+bool rotation_due(int64_t size, int limit_kb) {
+    return size / 1024 > limit_kb || size > INT_MAX - MAX_CAPACITY;
+}
+
+int write_log_data(int type, const char* buf, int len) {
+    LogFile* entry = &log_files[type];
+    ssize_t done = write_fully(entry->fd, buf, static_cast<size_t>(len));
+    if (done < len) {
+        int err = errno;
+        if (!write_failure_recorded[type]) {
+            write_failure_recorded[type] = true;
+            HLOG(TAG_TRANSIST, WLOG_ERROR, "write log data to %s fail,%s(%d), %d of %d bytes lost",
+                 entry->name, strerror(err), err, len - static_cast<int>(done > 0 ? done : 0), len);
+        }
+        if (done < 0) done = 0;
+    }
+    entry->size += static_cast<int>(done);
+    return static_cast<int>(done);
+}
+
+void close_log_file(LogFile* entry) {
+    if (entry->fd > 0) {
+        // Closed for good: what the collectors sent must survive a power cut.
+        RETRY_EINTR(fsync(entry->fd));
+        close(entry->fd);
+    }
+    entry->fd = -1;
+}
+
+int rotate_log_files(LogFile* entry) {
+    close_log_file(entry);
+    char from[PATH_LEN + 8];
+    char to[PATH_LEN + 8];
+    for (int i = 4; i >= 1; i--) {
+        if (i == 1) {
+            snprintf(from, sizeof(from), "%s", entry->name);
+        } else {
+            snprintf(from, sizeof(from), "%s.%d", entry->name, i - 1);
+        }
+        snprintf(to, sizeof(to), "%s.%d", entry->name, i);
+        // A generation that does not exist yet is normal.
+        if (rename(from, to) != 0 && errno != ENOENT) perror("while rotating log files");
+    }
+    entry->fd = open_log_file(entry->name);
+    entry->size = 0;
+    write_failure_recorded[type_of(entry)] = false;
+    if (entry->fd < 0) {
+        int err = errno;
+        HLOG(TAG_TRANSIST, WLOG_ERROR, "couldn't open output file %s,(%d)%s", entry->name, err,
+             strerror(err));
+        entry->fd = -1;
+        return -1;
+    }
+    return 0;
+}
+
+void close_all_log_files() {
+    for (LogFile& entry : log_files) {
+        close_log_file(&entry);
+        if (entry.sock > 0) close(entry.sock);
+        entry.sock = -1;
+        entry.name[0] = '\0';
+    }
+}
+
+void change_log_folder(const char* new_folder, int new_rotate_kb) {
+    pthread_mutex_lock(&file_table_lock);
+    for (int type = 0; type < LOG_TYPE_COUNT; type++) {
+        LogFile* entry = &log_files[type];
+        if (entry->fd <= 0) continue;
+        char name[PATH_LEN];
+        if (new_folder == nullptr || !compose_log_name(name, new_folder, type)) {
+            // Keep writing where we are rather than lose the type's logs.
+            HLOG(TAG_TRANSIST, WLOG_ERROR, "new log folder path too long, %s stays in %s",
+                 log_type_name(type), entry->name);
+            continue;
+        }
+        close_log_file(entry);
+        memcpy(entry->name, name, sizeof(name));
+        entry->fd = open_log_file(entry->name);
+        entry->size = 0;
+        write_failure_recorded[type] = false;
+        if (entry->fd < 0) {
+            int err = errno;
+            HLOG(TAG_TRANSIST, WLOG_ERROR, "Change filename %s fail, errno = %d: %s", entry->name,
+                 err, strerror(err));
+            entry->fd = -1;
+        }
+    }
+    pthread_mutex_unlock(&file_table_lock);
+    HLOG(TAG_TRANSIST, WLOG_INFO, "rotates size change from %dK to %dK", rotate_limit_kb.load(),
+         new_rotate_kb);
+    rotate_limit_kb = new_rotate_kb;
+}

@@ -1,0 +1,363 @@
+// The reader thread: accepts collector connections on "log_socket", learns
+// each one's log type from its first byte and appends what it sends to the
+// fill queue. At a stop it reads every connection to its end first, so that
+// nothing a collector sent before it ended is lost.
+#include <errno.h>
+#include <poll.h>
+#include <string.h>
+#include <sys/prctl.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include "common/io_util.h"
+#include "common/wlog.h"
+#include "storage/history_log.h"
+#include "transist/transist.h"
+#include "transist/transist_queue.h"
+#include "transist/transist_reader.h"
+#include "transist/transist_state.h"
+
+// Guards only the copy of the registered descriptors into the poll set.
+static pthread_mutex_t select_set_lock = PTHREAD_MUTEX_INITIALIZER;
+
+// A connection that has not sent its log type yet.
+struct PendingConn {
+    int fd;           // -1 when the slot is free
+    int64_t expires;  // monotonic microseconds
+};
+static PendingConn pending[MAX_PENDING];
+static bool pending_full_recorded = false;
+
+// Per type, while its connection lasts: whether dropping its data was recorded,
+// and whether an allocation failure was.
+static bool drop_recorded[LOG_TYPE_COUNT];
+static bool malloc_failure_recorded = false;
+
+static void close_fd(int fd) {
+    if (fd >= 0) close(fd);
+}
+
+// Puts a chunk into the fill queue, or drops it when nobody will write it.
+static void queue_chunk(int type, const char* data, int n) {
+    if (log_files[type].fd <= 0 || !writer_running) {
+        // Kept chunks of a type without a file would only grow the daemon's
+        // memory until the run ends; any local process can send them.
+        if (!drop_recorded[type]) {
+            drop_recorded[type] = true;
+            HLOG(TAG_TRANSIST, WLOG_WARN, "no writable %s file, its data is dropped",
+                 log_type_name(type));
+        }
+        return;
+    }
+    pthread_mutex_lock(&queue_lock);
+    int rc = queue_append(fill_queue, type, data, n, transist_capacity);
+    int err = errno;
+    pthread_mutex_unlock(&queue_lock);
+    if (rc == 1) {
+        malloc_failure_recorded = false;
+    } else if (!malloc_failure_recorded) {
+        // Recorded once per streak: a memory shortage fails every chunk.
+        malloc_failure_recorded = true;
+        HLOG(TAG_TRANSIST, WLOG_ERROR, "malloc buf %d fail(%s)", transist_capacity, strerror(err));
+    }
+}
+
+int read_log_message(int type, int fd) {
+    char buf[CHUNK_MAX + 1];
+    ssize_t n = read(fd, buf, CHUNK_MAX);
+    if (n < 0) {
+        int err = errno;
+        if (err == EAGAIN || err == EWOULDBLOCK || err == EINTR) return -1;
+        HLOG(TAG_TRANSIST, WLOG_ERROR, "read from socket %d failed (%s)%d", fd, strerror(err), err);
+        return 0;
+    }
+    if (n == 0) {
+        HLOG(TAG_TRANSIST, WLOG_ERROR, "receive an empty message from socket");
+        return 0;
+    }
+    queue_chunk(type, buf, static_cast<int>(n));
+    return 1;
+}
+
+// Called with file_table_lock held, after read_log_message returned 0.
+static void drop_connection(int type) {
+    HLOG(TAG_TRANSIST, WLOG_ERROR, "handle log message failed in fd of %s.", log_type_name(type));
+    close_fd(log_files[type].sock);
+    pthread_mutex_lock(&select_set_lock);
+    log_files[type].sock = -1;
+    pthread_mutex_unlock(&select_set_lock);
+}
+
+// Reads the type's connection until it has nothing more right now (or ends),
+// at most max_chunks chunks. Returns false when the connection was closed.
+// Called with file_table_lock held.
+static bool read_available(int type, int max_chunks) {
+    for (int i = 0; i < max_chunks; i++) {
+        int rc = read_log_message(type, log_files[type].sock);
+        if (rc < 0) return true;
+        if (rc == 0) {
+            drop_connection(type);
+            return false;
+        }
+    }
+    return true;
+}
+
+// A later connection of the same type takes the slot. What the earlier one
+// still has buffered is read first, so its bytes stay ahead of the new
+// stream's; the earlier connection is then closed.
+static void register_connection(int type, int fd) {
+    pthread_mutex_lock(&file_table_lock);
+    if (log_files[type].sock >= 0) {
+        if (read_available(type, 256)) {
+            HLOG(TAG_TRANSIST, WLOG_WARN, "%s connection replaced by a new one",
+                 log_type_name(type));
+            close_fd(log_files[type].sock);
+        }
+    }
+    drop_recorded[type] = false;
+    pthread_mutex_lock(&select_set_lock);
+    log_files[type].sock = fd;
+    pthread_mutex_unlock(&select_set_lock);
+    pthread_mutex_unlock(&file_table_lock);
+    WLOG(TAG_TRANSIST, WLOG_DEBUG, "accept over, new client:%c", LOG_TYPE_LETTERS[type]);
+}
+
+static void close_pending(int slot) {
+    close_fd(pending[slot].fd);
+    pending[slot].fd = -1;
+    pending_full_recorded = false;
+}
+
+// Reads the one-byte log type of a pending connection, if it has arrived.
+static void handle_pending(int slot) {
+    unsigned char letter = 0;
+    ssize_t n = read(pending[slot].fd, &letter, 1);
+    if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK || errno == EINTR)) return;
+    if (n <= 0) {
+        int err = n < 0 ? errno : 0;
+        HLOG(TAG_TRANSIST, WLOG_WARN, "new client ended before its log type (%d)", err);
+        close_pending(slot);
+        return;
+    }
+    int type = log_type_from_letter(static_cast<char>(letter));
+    if (type < 0) {
+        HLOG(TAG_TRANSIST, WLOG_WARN, "unknown log type 0x%02x from new client, closed", letter);
+        close_pending(slot);
+        return;
+    }
+    int fd = pending[slot].fd;
+    pending[slot].fd = -1;
+    pending_full_recorded = false;
+    register_connection(type, fd);
+}
+
+static void accept_connections() {
+    for (;;) {
+        int fd = accept4(transist_listen_fd, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC);
+        if (fd < 0) {
+            int err = errno;
+            if (err == EAGAIN || err == EWOULDBLOCK || err == EINTR || err == ECONNABORTED) return;
+            HLOG(TAG_TRANSIST, WLOG_ERROR, "accept failed (%s), errno = %d", strerror(err), err);
+            // Usually out of descriptors: give the system a moment, but stay
+            // responsive to a stop.
+            struct pollfd wake = {reader_wake_fd, POLLIN, 0};
+            if (!stop_requested) RETRY_EINTR(poll(&wake, 1, 1000));
+            return;
+        }
+        int slot = -1;
+        for (int i = 0; i < MAX_PENDING; i++) {
+            if (pending[i].fd < 0) {
+                slot = i;
+                break;
+            }
+        }
+        if (slot < 0) {
+            if (!pending_full_recorded) {
+                pending_full_recorded = true;
+                HLOG(TAG_TRANSIST, WLOG_WARN, "too many new clients without log type, closed");
+            }
+            close(fd);
+            continue;
+        }
+        pending[slot].fd = fd;
+        pending[slot].expires = monotonic_us() + PENDING_TIMEOUT_MS * 1000LL;
+        // Collectors send their letter right after connecting: usually it is
+        // already here.
+        handle_pending(slot);
+    }
+}
+
+static void expire_pending(int64_t now) {
+    for (int i = 0; i < MAX_PENDING; i++) {
+        if (pending[i].fd >= 0 && now >= pending[i].expires) {
+            HLOG(TAG_TRANSIST, WLOG_WARN, "new client sent no log type in %d ms, closed",
+                 PENDING_TIMEOUT_MS);
+            close_pending(i);
+        }
+    }
+}
+
+// Layout of one poll set: listening socket, wake counter, pending, registered.
+struct PollSet {
+    struct pollfd fds[2 + MAX_PENDING + LOG_TYPE_COUNT];
+    int pending_slot[MAX_PENDING + LOG_TYPE_COUNT];  // per entry after the first two
+    int type[MAX_PENDING + LOG_TYPE_COUNT];          // -1 for a pending entry
+    int count;
+};
+
+static void add_fd(PollSet* set, int fd, int slot, int type) {
+    set->fds[set->count] = {fd, POLLIN, 0};
+    if (set->count >= 2) {
+        set->pending_slot[set->count - 2] = slot;
+        set->type[set->count - 2] = type;
+    }
+    set->count++;
+}
+
+static void build_poll_set(PollSet* set, bool with_registered, bool with_control) {
+    set->count = 0;
+    if (with_control) {
+        add_fd(set, transist_listen_fd, -1, -1);
+        add_fd(set, reader_wake_fd, -1, -1);
+    }
+    // Keep the first two entries' places so indexes stay fixed.
+    while (set->count < 2) add_fd(set, -1, -1, -1);
+    for (int i = 0; i < MAX_PENDING; i++) {
+        if (pending[i].fd >= 0) add_fd(set, pending[i].fd, i, -1);
+    }
+    if (!with_registered) return;
+    pthread_mutex_lock(&select_set_lock);
+    for (int type = 0; type < LOG_TYPE_COUNT; type++) {
+        if (log_files[type].sock > 0) add_fd(set, log_files[type].sock, -1, type);
+    }
+    pthread_mutex_unlock(&select_set_lock);
+}
+
+// Handles what poll reported for pending and registered connections; reads at
+// most chunks_per_fd chunks from each registered one.
+static void handle_ready(const PollSet* set, int chunks_per_fd) {
+    bool any_registered = false;
+    for (int i = 2; i < set->count; i++) {
+        if (set->fds[i].revents == 0) continue;
+        if (set->type[i - 2] < 0) {
+            if (pending[set->pending_slot[i - 2]].fd == set->fds[i].fd) {
+                handle_pending(set->pending_slot[i - 2]);
+            }
+        } else {
+            any_registered = true;
+        }
+    }
+    if (!any_registered) return;
+    pthread_mutex_lock(&file_table_lock);
+    for (int i = 2; i < set->count; i++) {
+        int type = set->type[i - 2];
+        if (type < 0 || set->fds[i].revents == 0) continue;
+        // The slot may have been taken over by a connection registered above.
+        if (log_files[type].sock != set->fds[i].fd) continue;
+        read_available(type, chunks_per_fd);
+    }
+    pthread_mutex_unlock(&file_table_lock);
+}
+
+// Decides under queue_lock whether the fill queue is too full to take more;
+// the writer's rotation clears the state and wakes us.
+static bool queue_full() {
+    pthread_mutex_lock(&queue_lock);
+    bool was_paused = reader_paused;
+    reader_paused = fill_queue->total >= QUEUE_HIGH_WATER;
+    bool paused = reader_paused;
+    pthread_mutex_unlock(&queue_lock);
+    if (paused && !was_paused) kick_writer();
+    return paused;
+}
+
+// After stop_requested: the collectors have ended, so every connection
+// reaches its end soon; read them all to it, within a short deadline.
+static void drain_at_stop() {
+    const int64_t deadline = monotonic_us() + STOP_DRAIN_MS * 1000LL;
+    for (;;) {
+        if (transist_listen_fd >= 0) accept_connections();
+        PollSet set;
+        build_poll_set(&set, true, false);
+        if (set.count == 2) break;
+        int64_t left_ms = (deadline - monotonic_us()) / 1000;
+        if (left_ms <= 0) break;
+        int n = poll(set.fds + 2, static_cast<nfds_t>(set.count - 2), static_cast<int>(left_ms));
+        if (n < 0 && errno != EINTR) break;
+        if (n > 0) handle_ready(&set, 64);
+    }
+    pthread_mutex_lock(&file_table_lock);
+    for (int type = 0; type < LOG_TYPE_COUNT; type++) {
+        if (log_files[type].sock < 0) continue;
+        HLOG(TAG_TRANSIST, WLOG_WARN, "%s connection still open at stop, closed",
+             log_type_name(type));
+        close_fd(log_files[type].sock);
+        pthread_mutex_lock(&select_set_lock);
+        log_files[type].sock = -1;
+        pthread_mutex_unlock(&select_set_lock);
+    }
+    pthread_mutex_unlock(&file_table_lock);
+    for (int i = 0; i < MAX_PENDING; i++) {
+        if (pending[i].fd >= 0) close_pending(i);
+    }
+}
+
+static void drain_wake_counter() {
+    uint64_t count;
+    while (read(reader_wake_fd, &count, sizeof(count)) > 0) {
+    }
+}
+
+void* read_thread(void*) {
+    prctl(PR_SET_NAME, "tavlo.reader");
+    WLOG(TAG_TRANSIST, WLOG_DEBUG, "read_thread: pid: %d, tid: %d", getpid(), gettid());
+    pthread_mutex_lock(&file_table_lock);
+    for (LogFile& entry : log_files) entry.sock = -1;
+    pthread_mutex_unlock(&file_table_lock);
+    for (PendingConn& conn : pending) conn.fd = -1;
+    for (bool& recorded : drop_recorded) recorded = false;
+    pending_full_recorded = false;
+    malloc_failure_recorded = false;
+
+    if (transist_listen_fd < 0) {
+        // Creation failed and was recorded; the run goes on without collectors.
+        mark_reader_done();
+        return reinterpret_cast<void*>(1);
+    }
+
+    while (!stop_requested) {
+        bool paused = queue_full();
+        PollSet set;
+        build_poll_set(&set, !paused, true);
+        int timeout_ms = 1000;
+        int64_t now = monotonic_us();
+        for (const PendingConn& conn : pending) {
+            if (conn.fd < 0) continue;
+            int64_t left = (conn.expires - now) / 1000 + 1;
+            if (left < timeout_ms) timeout_ms = left > 0 ? static_cast<int>(left) : 0;
+        }
+        int n = poll(set.fds, static_cast<nfds_t>(set.count), timeout_ms);
+        if (n < 0) {
+            int err = errno;
+            if (err == EINTR) continue;
+            HLOG(TAG_TRANSIST, WLOG_ERROR, "select failed (%s), error = %d", strerror(err), err);
+            struct pollfd wake = {reader_wake_fd, POLLIN, 0};
+            RETRY_EINTR(poll(&wake, 1, 1000));
+            continue;
+        }
+        if (n > 0) {
+            if (set.fds[1].revents != 0) drain_wake_counter();
+            if (set.fds[0].revents != 0) accept_connections();
+            handle_ready(&set, 1);
+        }
+        expire_pending(monotonic_us());
+    }
+
+    drain_at_stop();
+    close(transist_listen_fd);
+    transist_listen_fd = -1;
+    WLOG(TAG_TRANSIST, WLOG_DEBUG, "read_thread exits");
+    mark_reader_done();
+    return reinterpret_cast<void*>(1);
+}

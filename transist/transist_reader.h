@@ -1,0 +1,15 @@
+// The reader side of "log_socket": one-byte log type, then plain log text.
+#pragma once
+
+// Connections that have not sent their log type yet, at most.
+constexpr int MAX_PENDING = 16;
+// A connection that names no log type within this time is closed.
+constexpr int PENDING_TIMEOUT_MS = 5000;
+// At a stop the collectors have already ended: what is left in their
+// connections arrives at once, so this bounds only stuck peers.
+constexpr int STOP_DRAIN_MS = 300;
+
+// Reads one chunk (at most CHUNK_MAX bytes) from the type's connection fd into
+// the fill queue. Returns 1 when a chunk was taken, 0 at end of stream or on a
+// read error (both recorded), -1 when nothing is available yet.
+int read_log_message(int type, int fd);

@@ -1,0 +1,151 @@
+// The writer thread: once per interval it exchanges the queue roles and writes
+// what the reader gathered to the log files. At a stop it writes every queued
+// byte and syncs the files before it ends.
+#include "transist/transist_writer.h"
+
+#include <errno.h>
+#include <string.h>
+#include <sys/prctl.h>
+#include <unistd.h>
+
+#include "common/io_util.h"
+#include "common/wlog.h"
+#include "core/control_socket.h"
+#include "core/log_controller.h"
+#include "storage/history_log.h"
+#include "storage/storage_check.h"
+#include "transist/log_files.h"
+#include "transist/transist.h"
+#include "transist/transist_queue.h"
+#include "transist/transist_reader.h"
+#include "transist/transist_state.h"
+
+static void notify_controller(uint64_t value) {
+    if (efd_thread < 0) return;
+    RETRY_EINTR(write(efd_thread, &value, sizeof(value)));
+}
+
+int writer_storage_blocked(LogController* controller, int (*is_low)(const char*), bool notify) {
+    if (controller == nullptr || is_low(controller->current_log_root()) != 1) return 0;
+    HLOG(TAG_TRANSIST, WLOG_ERROR, "no space to write log");
+    if (notify) {
+        reply_client(controller, -1, "storage_full");
+        notify_controller(EVENT_STORAGE_LOW);
+    }
+    return 1;
+}
+
+int flush_one_queue(TransistQueue* q, bool notify) {
+    int written = 0;
+    for (int type = 0; type < LOG_TYPE_COUNT; type++) {
+        LogFile* entry = &log_files[type];
+        BufferList* list = &q->lists[type];
+        // A type without a file keeps its chunks (the reader queues none).
+        if (entry->fd <= 0 || list->head == nullptr) continue;
+        int retries = 10;
+        while (list->head != nullptr) {
+            // The folder can be removed under a running log: notice it here
+            // rather than write into unlinked files.
+            if (access(entry->name, F_OK) != 0) {
+                int err = errno;
+                if (err == EINTR && retries-- > 0) {
+                    HLOG(TAG_TRANSIST, WLOG_ERROR, "EINTR come when access %s", entry->name);
+                    continue;
+                }
+                HLOG(TAG_TRANSIST, WLOG_ERROR, "log files %s not exist:%d", entry->name, err);
+                if (notify) {
+                    reply_client(transist_controller, -1, "log_folder_lost");
+                    notify_controller(EVENT_FOLDER_LOST);
+                }
+                return FLUSH_FOLDER_LOST;
+            }
+            LogBuffer* node = list->head;
+            written += write_log_data(type, node->buf, node->len);
+            // The node leaves the queue whether or not the disk took it all.
+            q->total -= node->len;
+            release_head(list);
+            if (rotation_due(entry->size, rotate_limit_kb) && rotate_log_files(entry) != 0) {
+                return FLUSH_REOPEN_FAILED;
+            }
+        }
+    }
+    return written;
+}
+
+int flush_queue() {
+    pthread_mutex_lock(&file_table_lock);
+    int rc = flush_one_queue(drain_queue, true);
+    pthread_mutex_unlock(&file_table_lock);
+    return rc;
+}
+
+// The writer is gone for the rest of the run: leave no file open behind it.
+static void close_files_only() {
+    pthread_mutex_lock(&file_table_lock);
+    for (LogFile& entry : log_files) close_log_file(&entry);
+    pthread_mutex_unlock(&file_table_lock);
+}
+
+// The storage gate at a stop looks at the files' own file system: the
+// controller's log root may already have been reset by then.
+static int files_storage_low() {
+    for (const LogFile& entry : log_files) {
+        if (entry.fd > 0) return is_storage_low(entry.name);
+    }
+    return 0;
+}
+
+static int finish_at_stop() {
+    if (!wait_reader_done(STOP_DRAIN_MS + 200)) {
+        HLOG(TAG_TRANSIST, WLOG_WARN, "reader still busy at stop, writing what is queued");
+    }
+    int rc = 0;
+    pthread_mutex_lock(&file_table_lock);
+    if (files_storage_low()) {
+        HLOG(TAG_TRANSIST, WLOG_ERROR, "no space to write log");
+    } else {
+        // Oldest first: the spare queue was drained a cycle before the drain
+        // queue, which was filled before the fill queue.
+        pthread_mutex_lock(&queue_lock);
+        TransistQueue* order[QUEUE_COUNT] = {spare_queue, drain_queue, fill_queue};
+        pthread_mutex_unlock(&queue_lock);
+        for (TransistQueue* q : order) {
+            rc = flush_one_queue(q, false);
+            if (rc < 0) break;
+        }
+    }
+    close_all_log_files();
+    pthread_mutex_unlock(&file_table_lock);
+    return rc == FLUSH_REOPEN_FAILED ? 1 : 2;
+}
+
+void* write_thread(void*) {
+    prctl(PR_SET_NAME, "tavlo.writer");
+    WLOG(TAG_TRANSIST, WLOG_DEBUG, "write_thread: pid: %d, tid: %d", getpid(), gettid());
+    const int64_t interval_us = static_cast<int64_t>(transist_interval) * 1000000;
+    writer_sleep_us(interval_us);
+    while (!stop_requested) {
+        if (writer_storage_blocked(transist_controller, is_storage_low, true)) {
+            writer_sleep_us(interval_us);
+            continue;
+        }
+        int64_t t0 = monotonic_us();
+        pthread_mutex_lock(&queue_lock);
+        rotate_queue_roles();
+        bool resume_reader = reader_paused;
+        reader_paused = false;
+        pthread_mutex_unlock(&queue_lock);
+        if (resume_reader) wake_reader();
+        if (drain_queue->total != 0 && flush_queue() == FLUSH_REOPEN_FAILED) {
+            writer_running = false;
+            close_files_only();
+            return reinterpret_cast<void*>(1);
+        }
+        int64_t elapsed = monotonic_us() - t0;
+        if (elapsed >= 0 && elapsed <= interval_us) writer_sleep_us(interval_us - elapsed);
+    }
+    int rc = finish_at_stop();
+    writer_running = false;
+    WLOG(TAG_TRANSIST, WLOG_DEBUG, "write_thread exits");
+    return reinterpret_cast<void*>(static_cast<intptr_t>(rc));
+}
