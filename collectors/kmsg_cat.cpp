@@ -1,0 +1,90 @@
+// The kernel log collector.
+#include "collectors/kmsg_cat.h"
+
+#include <errno.h>
+#include <fcntl.h>
+#include <stdio.h>
+#include <stdlib.h>
+#include <string.h>
+#include <sys/select.h>
+#include <unistd.h>
+
+#include "collectors/control_block.h"
+#include "common/io_util.h"
+#include "common/wlog.h"
+#include "storage/history_log.h"
+
+const char* KmsgCat::kmsg_path = "/proc/kmsg";
+
+// One read of at most this many bytes per chunk; the transist reassembles them.
+constexpr int KMSG_CHUNK = 255;
+// After data, wait this long for more before going back to an unbounded wait.
+constexpr int KMSG_QUIET_SECONDS = 3;
+
+void KmsgCat::run(const char*, int block_fd) {
+    if (install_stop_signal(this) != 0) {
+        int err = errno;
+        HLOG(TAG_KERNEL, WLOG_ERROR, "signal for switch failed. errno = %d, %s", err, strerror(err));
+    }
+    shm_fd = block_fd;
+    if (shm_fd == -1 || !attach_control_block(this)) {
+        // No block (or no lock for it): nothing can be marked.
+        int err = shm_fd == -1 ? EBADF : errno;
+        HLOG(TAG_KERNEL, WLOG_ERROR, "shm open failed! errno = %d, %s", err, strerror(err));
+        exit(1);
+    }
+
+    int kmsg_fd = RETRY_EINTR(open(kmsg_path, O_RDONLY | O_NONBLOCK | O_CLOEXEC));
+    if (kmsg_fd < 0) {
+        int err = errno;
+        fprintf(stderr, "Unable to open /proc/kmsg: %s\n", strerror(err));
+        HLOG(TAG_KERNEL, WLOG_ERROR, "Unable to open /proc/kmsg: %s", strerror(err));
+        exit_collector(this, 1, REASON_OPEN);
+    }
+
+    connect_transist(this);
+    forward(kmsg_fd);
+}
+
+void KmsgCat::forward(int kmsg_fd) {
+    sigset_t wait_mask;
+    hold_stop_signal(&wait_mask);
+
+    char buf[KMSG_CHUNK + 1];
+    bool wait_forever = true;
+    for (;;) {
+        check_stop(this);
+        memset(buf, 0, KMSG_CHUNK);
+
+        fd_set readable;
+        int ready;
+        do {
+            FD_ZERO(&readable);
+            FD_SET(kmsg_fd, &readable);
+            // Each bounded wait gets the whole quiet period again.
+            struct timespec quiet = {KMSG_QUIET_SECONDS, 0};
+            ready = pselect(kmsg_fd + 1, &readable, nullptr, nullptr,
+                            wait_forever ? nullptr : &quiet, &wait_mask);
+        } while (ready < 0 && errno == EINTR);
+        if (ready < 0) continue;
+
+        if (ready > 0 && FD_ISSET(kmsg_fd, &readable)) {
+            ssize_t n = read(kmsg_fd, buf, KMSG_CHUNK);
+            if (n < 0) {
+                WLOG(TAG_KERNEL, WLOG_DEBUG, "Maybe others read kmsg, ignore.(%s)", strerror(errno));
+                continue;
+            }
+            if (n == 0) {
+                WLOG(TAG_KERNEL, WLOG_DEBUG,
+                     "read: Unexpected EOF! Maybe others read kmsg, ingore.\n");
+                continue;
+            }
+            if (send_to_transist(buf, static_cast<size_t>(n), transist_fd) == -1) {
+                int err = errno;
+                HLOG(TAG_KERNEL, WLOG_ERROR, "write fails: %s, errno = %d", strerror(err), err);
+                return;
+            }
+        }
+        wait_forever = ready == 0;
+    }
+}
