@@ -1,5 +1,6 @@
 #include "storage/history_log.h"
 
+#include <atomic>
 #include <errno.h>
 #include <fcntl.h>
 #include <libgen.h>
@@ -35,6 +36,12 @@ int history_mode_set = 0;
 // record (make_dir_recursive failing under the lock) must not take it again.
 thread_local bool holding_history_lock = false;
 
+// The C library's local-time conversion takes a process-wide lock that a fork
+// can leave held by a thread that no longer exists. A forked child therefore
+// converts by hand, with the offset from UTC that the parent saw last.
+std::atomic<long> utc_offset{0};
+std::atomic<bool> forked_child{false};
+
 // Appends one record with a single write: O_APPEND places it at the end at the
 // moment of the write, so records of different processes never interleave.
 // A file that cannot be opened loses this record silently.
@@ -59,11 +66,50 @@ __attribute__((constructor)) void register_history_fork_handler() {
     pthread_atfork(nullptr, nullptr, history_log_after_fork);
 }
 
+// Broken-down time of t seconds since the epoch, without the C library
+// (Howard Hinnant's civil-from-days).
+void civil_time(long long t, struct tm* out) {
+    long long days = t / 86400;
+    long long secs = t % 86400;
+    if (secs < 0) {
+        secs += 86400;
+        days -= 1;
+    }
+    long long z = days + 719468;
+    long long era = (z >= 0 ? z : z - 146096) / 146097;
+    long long doe = z - era * 146097;
+    long long yoe = (doe - doe / 1460 + doe / 36524 - doe / 146096) / 365;
+    long long doy = doe - (365 * yoe + yoe / 4 - yoe / 100);
+    long long mp = (5 * doy + 2) / 153;
+    out->tm_mday = static_cast<int>(doy - (153 * mp + 2) / 5 + 1);
+    out->tm_mon = static_cast<int>(mp < 10 ? mp + 2 : mp - 10);
+    out->tm_year = static_cast<int>(yoe + era * 400 + (out->tm_mon <= 1 ? 1 : 0) - 1900);
+    out->tm_hour = static_cast<int>(secs / 3600);
+    out->tm_min = static_cast<int>(secs / 60 % 60);
+    out->tm_sec = static_cast<int>(secs % 60);
+}
+
+// "%Y:%m:%d %H:%M:%S " of the local time: 20 characters. Formatted by hand
+// because strftime, too, takes the time-zone lock.
+void format_stamp(char* out, size_t n) {
+    time_t now = time(nullptr);
+    struct tm local;
+    bool ok = false;
+    if (!forked_child.load(std::memory_order_relaxed)) {
+        ok = localtime_r(&now, &local) != nullptr;
+        if (ok) utc_offset.store(local.tm_gmtoff, std::memory_order_relaxed);
+    }
+    if (!ok) civil_time(static_cast<long long>(now) + utc_offset.load(std::memory_order_relaxed), &local);
+    snprintf(out, n, "%04d:%02d:%02d %02d:%02d:%02d ", local.tm_year + 1900, local.tm_mon + 1,
+             local.tm_mday, local.tm_hour, local.tm_min, local.tm_sec);
+}
+
 }  // namespace
 
 void history_log_after_fork() {
     pthread_mutex_init(&history_lock, nullptr);
     holding_history_lock = false;
+    forked_child.store(true, std::memory_order_relaxed);
 }
 
 void history_log(int level, const char* format, ...) {
@@ -71,12 +117,7 @@ void history_log(int level, const char* format, ...) {
     if (holding_history_lock) return;
 
     char stamp[RECORD_LEN + 1];
-    time_t now = time(nullptr);
-    struct tm local;
-    if (localtime_r(&now, &local) == nullptr ||
-        strftime(stamp, sizeof(stamp), "%Y:%m:%d %H:%M:%S ", &local) == 0) {
-        stamp[0] = '\0';
-    }
+    format_stamp(stamp, sizeof(stamp));
 
     char message[RECORD_LEN + 1];
     va_list args;
