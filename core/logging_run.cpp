@@ -1,0 +1,352 @@
+// Starting, stopping and moving a logging run.
+#include "core/logging_run.h"
+
+#include <errno.h>
+#include <fcntl.h>
+#include <limits.h>
+#include <pthread.h>
+#include <semaphore.h>
+#include <signal.h>
+#include <stdint.h>
+#include <stdio.h>
+#include <stdlib.h>
+#include <string.h>
+#include <sys/mman.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <time.h>
+#include <unistd.h>
+
+#include <cutils/ashmem.h>
+
+#include "collectors/collector_link.h"
+#include "collectors/control_block.h"
+#include "collectors/fork_collectors.h"
+#include "common/io_util.h"
+#include "common/wlog.h"
+#include "core/child_supervision.h"
+#include "core/log_controller.h"
+#include "platform/properties.h"
+#include "storage/history_log.h"
+#include "transist/transist.h"
+
+#define RUN_FOLDER_ROOT "/qrvlog/tavlolog/"
+#define RUN_FOLDER_PATTERN "APLog_%Y_%m%d_%H%M%S/"
+
+constexpr useconds_t STOP_STEP_US = 100000;
+// Polls of `exited` after SIGUSR1: the collectors get at most 0.9 s.
+constexpr int STOP_POLLS = 9;
+// How long a killed collector may take to be gone, polled every 5 ms.
+constexpr int KILL_WAIT_POLLS = 20;
+constexpr useconds_t KILL_WAIT_STEP_US = 5000;
+
+void compose_run_folder(LogController* controller) {
+    char name[PATH_LEN - 1] = {};
+    time_t now = time(nullptr);
+    struct tm local;
+    localtime_r(&now, &local);
+    strftime(name, sizeof(name), RUN_FOLDER_PATTERN, &local);
+    int len = snprintf(controller->run_folder, sizeof(controller->run_folder), "%s" RUN_FOLDER_ROOT "%s",
+                       controller->logpath, name);
+    if (len < 0 || len >= PATH_LEN) {
+        // A cut name would be some other folder; an empty one is refused by
+        // create_run_folder.
+        HLOG(TAG_MAIN, WLOG_ERROR, "run folder under %.64s... does not fit %d characters",
+             controller->logpath, PATH_LEN - 1);
+        controller->run_folder[0] = '\0';
+        return;
+    }
+    HLOG(TAG_MAIN, WLOG_INFO, "full path is:%s", controller->run_folder);
+}
+
+int create_run_folder(LogController*, const char* base, const char* path) {
+    char folder[PATH_LEN];
+    size_t len = strnlen(path, PATH_LEN);
+    bool needs_slash = len == 0 || path[len - 1] != '/';
+    if (len + (needs_slash ? 1 : 0) >= static_cast<size_t>(PATH_LEN)) {
+        HLOG(TAG_MAIN, WLOG_ERROR, "mkdir %.64s... refused: longer than %d characters", path,
+             PATH_LEN - 1);
+        return -1;
+    }
+    memcpy(folder, path, len);
+    if (needs_slash) folder[len++] = '/';
+    folder[len] = '\0';
+
+    const char* at = strstr(folder, base);
+    if (at == nullptr || path[0] == '\0') {
+        HLOG(TAG_MAIN, WLOG_ERROR, "mkdir %s refused: not under %s", folder, base);
+        return -1;
+    }
+    for (char* p = folder + (at - folder) + 1; *p != '\0'; p++) {
+        if (*p != '/') continue;
+        *p = '\0';
+        if (access(folder, F_OK) != 0 && mkdir(folder, 0770) != 0) {
+            int err = errno;
+            HLOG(TAG_MAIN, WLOG_ERROR, "mkdir %s fails, errno:%s(%d)", folder, strerror(err), err);
+        }
+        *p = '/';
+    }
+    if (access(folder, F_OK) != 0) {
+        HLOG(TAG_MAIN, WLOG_ERROR, "mkdir %s fails at last", folder);
+        return -1;
+    }
+    HLOG(TAG_MAIN, WLOG_INFO, "mkdir %s success", folder);
+    return 1;
+}
+
+int calc_rotate_size(LogController* controller, int megabytes) {
+    if (controller->log_file_num <= 0) {
+        HLOG(TAG_MAIN, WLOG_ERROR, "Invalid log file num:%d", controller->log_file_num);
+        return 0;
+    }
+    if (megabytes < 0) {
+        HLOG(TAG_MAIN, WLOG_ERROR, "Invalid log size:%d", megabytes);
+        return 0;
+    }
+    // 64-bit: a large configured size must not wrap into a negative limit.
+    int64_t kb = static_cast<int64_t>(megabytes) * 1024 / controller->log_file_num;
+    return kb > INT_MAX ? INT_MAX : static_cast<int>(kb);
+}
+
+static void set_logsize_property(int rotate_kb) {
+    char value[10];
+    snprintf(value, sizeof(value), "%d", rotate_kb);
+    property_set(PROP_LOGSIZE, value);
+}
+
+// Unmaps and closes what the previous run left of its block and semaphore.
+static void release_control_block(LogController* controller) {
+    if (controller->shm != nullptr) {
+        munmap(controller->shm, CONTROL_BLOCK_SIZE);
+        controller->shm = nullptr;
+    }
+    if (controller->sem != nullptr) {
+        sem_close(controller->sem);
+        controller->sem = nullptr;
+    }
+}
+
+static void create_control_block(LogController* controller) {
+    release_control_block(controller);
+    shm_fd = ashmem_create_region(CONTROL_BLOCK_NAME, CONTROL_BLOCK_SIZE);
+    if (shm_fd < 0) {
+        int err = errno;
+        HLOG(TAG_MAIN, WLOG_ERROR, "ashmem create failed!errno:%s(%d)", strerror(err), err);
+        exit(1);
+    }
+    // A semaphore left by a daemon that died mid-run may be held by a dead
+    // collector; each run starts with a fresh one.
+    sem_unlink(CONTROL_SEM_NAME);
+    sem_t* sem = sem_open(CONTROL_SEM_NAME, O_CREAT, 0644, 1);
+    if (sem == SEM_FAILED) {
+        int err = errno;
+        HLOG(TAG_MAIN, WLOG_ERROR, "sem_open %s failed!errno:%s(%d)", CONTROL_SEM_NAME, strerror(err),
+             err);
+        exit(1);
+    }
+    void* map = mmap(nullptr, CONTROL_BLOCK_SIZE, PROT_READ | PROT_WRITE, MAP_SHARED, shm_fd, 0);
+    if (map == MAP_FAILED) {
+        int err = errno;
+        HLOG(TAG_MAIN, WLOG_ERROR, "mmap shared memory failed!errno:%s(%d)", strerror(err), err);
+        exit(1);
+    }
+    controller->sem = sem;
+    controller->shm = static_cast<ControlBlock*>(map);
+    memset(controller->shm, 0, CONTROL_BLOCK_SIZE);
+    for (int slot = SLOT_MAIN; slot <= SLOT_BT; slot++) controller->shm->slots[slot].reason = REASON_NONE;
+    WLOG(TAG_MAIN, WLOG_DEBUG, "create shared memory ok!");
+}
+
+static void mark_not_started(LogController* controller, int slot) {
+    controller->shm->slots[slot].exited = 1;
+}
+
+void start_logging(LogController* controller) {
+    struct sigaction sa;
+    memset(&sa, 0, sizeof(sa));
+    sa.sa_handler = sigchld_handler;
+    sa.sa_flags = SA_RESTART | SA_NOCLDSTOP;
+    sigemptyset(&sa.sa_mask);
+    sigaction(SIGCHLD, &sa, nullptr);
+
+    if (controller->boot_mode == 0) oru_mode_on();
+    set_logsize_property(controller->rotate_size_kb);
+    property_set(PROP_RUNNING, "1");
+
+    transist_create(controller, controller->run_folder, controller->rotate_size_kb);
+    create_control_block(controller);
+
+    if (controller->android_log) {
+        // The Android collectors are not part of this build.
+        HLOG(TAG_MAIN, WLOG_INFO, "no collector for %s in this build", "main_log,radio_log,events_log");
+    }
+    mark_not_started(controller, SLOT_MAIN);
+    mark_not_started(controller, SLOT_RADIO);
+    mark_not_started(controller, SLOT_EVENTS);
+    if (controller->kernel_log) {
+        fork_kernel_log(controller, shm_fd);
+    } else {
+        mark_not_started(controller, SLOT_KERNEL);
+    }
+    if (controller->bt_log) {
+        HLOG(TAG_MAIN, WLOG_INFO, "no collector for %s in this build", "bt_log");
+    }
+    mark_not_started(controller, SLOT_BT);
+
+    HLOG(TAG_MAIN, WLOG_INFO, "M(%d),R(%d),E(%d),K(%d),B(%d)", controller->mlog_pid,
+         controller->rlog_pid, controller->elog_pid, controller->klog_pid, controller->blog_pid);
+}
+
+static bool all_collectors_exited(const LogController* controller) {
+    for (int slot = SLOT_MAIN; slot <= SLOT_BT; slot++) {
+        if (__atomic_load_n(&controller->shm->slots[slot].exited, __ATOMIC_SEQ_CST) == 0) return false;
+    }
+    return true;
+}
+
+// True once pid has ended (reaped now, or already gone). A zombie has closed
+// its descriptors, which is what the stop waits for.
+static bool child_gone(pid_t pid) {
+    pid_t rc = waitpid(pid, nullptr, WNOHANG);
+    return rc != 0;
+}
+
+// SIGKILL to every collector still running, then wait (bounded) until they are
+// gone, so that their connections are closed before the transist drains them.
+static void kill_collectors(LogController* controller) {
+    pid_t pids[LOG_TYPE_COUNT] = {controller->mlog_pid, controller->rlog_pid, controller->elog_pid,
+                                  controller->klog_pid, controller->blog_pid};
+    signal_children(controller, SIGKILL);
+    for (int poll = 0; poll < KILL_WAIT_POLLS; poll++) {
+        bool all_gone = true;
+        for (pid_t& pid : pids) {
+            if (pid > 0 && child_gone(pid)) pid = 0;
+            if (pid > 0) all_gone = false;
+        }
+        if (all_gone) return;
+        usleep(KILL_WAIT_STEP_US);
+    }
+}
+
+static void join_transist_thread(pthread_t thread, const char* which) {
+    void* result = nullptr;
+    // A thread the transist could not create has the zero handle; joining it
+    // would crash the daemon.
+    int rc = pthread_equal(thread, pthread_t()) ? ESRCH : pthread_join(thread, &result);
+    if (rc != 0) {
+        if (strcmp(which, "read") == 0) {
+            HLOG(TAG_MAIN, WLOG_ERROR, "cannot join with read thread (%s)%d", strerror(rc), rc);
+        } else {
+            HLOG(TAG_MAIN, WLOG_ERROR, "cannot join with write thread (%s)%d", strerror(rc), rc);
+        }
+        return;
+    }
+    int value = static_cast<int>(reinterpret_cast<intptr_t>(result));
+    if (strcmp(which, "read") == 0) {
+        HLOG(TAG_MAIN, WLOG_INFO, "read thread exit %d", value);
+    } else {
+        HLOG(TAG_MAIN, WLOG_INFO, "write thread exit %d", value);
+    }
+}
+
+void stop_logging(LogController* controller) {
+    // The collectors ended below are reaped by the system and start no check.
+    signal(SIGCHLD, SIG_IGN);
+    controller->log_path_state = -1;
+    if (!is_running()) {
+        HLOG(TAG_MAIN, WLOG_ERROR, "tavlolog already stopped, ignore this stop");
+        return;
+    }
+    property_set(PROP_RUNNING, "0");
+
+    if (controller->shm != nullptr) {
+        int locked = control_block_lock(controller->sem);
+        __atomic_store_n(&control_stop(controller->shm), 1, __ATOMIC_SEQ_CST);
+        if (locked) control_block_unlock(controller->sem);
+    }
+    usleep(STOP_STEP_US);
+    signal_children(controller, SIGUSR1);
+    for (int poll = 0; poll < STOP_POLLS; poll++) {
+        usleep(STOP_STEP_US);
+        if (controller->shm == nullptr || all_collectors_exited(controller)) break;
+    }
+    kill_collectors(controller);
+    controller->warned = 0;
+    sem_unlink(CONTROL_SEM_NAME);
+    if (shm_fd > 0) close(shm_fd);
+    shm_fd = -1;
+    release_control_block(controller);
+
+    // Only now that no collector can write any more may the transist finish:
+    // it reads the connections to their end and writes every queued byte.
+    stop_requested = true;
+    transist_wake();
+    join_transist_thread(read_thread_id, "read");
+    join_transist_thread(write_thread_id, "write");
+    stop_requested = false;
+    HLOG(TAG_MAIN, WLOG_INFO, "tavlolog stop done");
+}
+
+void switch_run_folder(LogController* controller, const char* path) {
+    if (property_set(PROP_REALPATH, path) < 0) {
+        HLOG(TAG_MAIN, WLOG_ERROR, "set %s to %s failed", PROP_REALPATH, path);
+    }
+    set_logsize_property(controller->rotate_size_kb);
+    change_log_folder(path, controller->rotate_size_kb);
+    sleep(1);
+}
+
+void signal_child(int pid, int sig) {
+    // 0 or a negative pid would reach the daemon's own process group.
+    if (pid <= 0) return;
+    if (waitpid(pid, nullptr, WNOHANG) != 0) return;
+    HLOG(TAG_MAIN, WLOG_INFO, "send %d to %d", sig, pid);
+    kill(pid, sig);
+}
+
+void signal_children(LogController* controller, int sig) {
+    pid_t* pids[LOG_TYPE_COUNT] = {&controller->mlog_pid, &controller->rlog_pid,
+                                   &controller->elog_pid, &controller->klog_pid,
+                                   &controller->blog_pid};
+    for (pid_t* pid : pids) {
+        if (*pid != 0) signal_child(*pid, sig);
+    }
+    if (sig == SIGKILL) {
+        for (pid_t* pid : pids) *pid = 0;
+    }
+}
+
+// Build flags of the exception engine, loaded on first use.
+static bool oru_flags_loaded = false;
+static bool oru_eng_build = false;
+static bool oru_customer_build = false;
+
+static void load_oru_flags() {
+    if (oru_flags_loaded) return;
+    char value[PROPERTY_VALUE_MAX];
+    property_get("ro.build.type", value, "user");
+    oru_eng_build = strcmp(value, "eng") == 0;
+    property_get("ro.oru.build.info", value, "customer");
+    oru_customer_build = strcmp(value, "customer") == 0;
+    oru_flags_loaded = true;
+}
+
+// The engine's tool reports nothing the daemon acts on.
+static void run_oru(const char* command) {
+    int rc = system(command);
+    (void)rc;
+}
+
+void oru_mode_on() {
+    load_oru_flags();
+    if (oru_eng_build) return;
+    HLOG(TAG_DEBUG, WLOG_INFO, "init oru mode:%d(1=>3,0=>1)", oru_customer_build ? 1 : 0);
+    run_oru(oru_customer_build ? "oru -m 3" : "oru -m 1");
+}
+
+void oru_mode_off() {
+    load_oru_flags();
+    if (oru_eng_build) return;
+    HLOG(TAG_DEBUG, WLOG_INFO, "deinit oru mode:%d(1=>4,0=>2)", oru_customer_build ? 1 : 0);
+    run_oru(oru_customer_build ? "oru -m 4" : "oru -m 2");
+}
