@@ -1,19 +1,21 @@
 // The emulated phone itself: boot, tools, isolation, power-off, reboot, the
 // kernel-log FIFO and the file-system rights the daemon's identity gets.
+#include <ctype.h>
 #include <dirent.h>
 #include <fcntl.h>
 #include <limits.h>
 #include <sched.h>
 #include <signal.h>
 #include <stddef.h>
-#include <string.h>
 #include <stdlib.h>
+#include <string.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <ostream>
 #include <string>
 #include <vector>
 
@@ -32,6 +34,14 @@ std::vector<std::string> as_daemon(const std::string& shell_command) {
     std::vector<std::string> args = kAsDaemon;
     args.insert(args.end(), {"sh", "-c", shell_command});
     return args;
+}
+
+// Test names from a case's description: letters and digits only.
+template <typename Case>
+std::string case_name(const ::testing::TestParamInfo<Case>& info, const char* text) {
+    std::string name;
+    for (const char* p = text; *p; p++) name += isalnum(static_cast<unsigned char>(*p)) ? *p : '_';
+    return (name.empty() ? "empty" : name) + "_" + std::to_string(info.index);
 }
 
 bool process_alive(pid_t pid) { return kill(pid, 0) == 0; }
@@ -143,6 +153,8 @@ struct BootModeCase {
     const char* file_content;  // what the daemon's read sees
 };
 
+void PrintTo(const BootModeCase& c, std::ostream* os) { *os << "boot mode '" << c.option << "'"; }
+
 class BootModeFileTest : public ::testing::TestWithParam<BootModeCase> {};
 
 TEST_P(BootModeFileTest, IsWhatTheOptionSays) {
@@ -167,7 +179,10 @@ INSTANTIATE_TEST_SUITE_P(Modes, BootModeFileTest,
                          ::testing::Values(BootModeCase{"0", true, "0\n"},
                                            BootModeCase{"10", true, "10\n"},
                                            BootModeCase{"", true, ""},
-                                           BootModeCase{"none", false, ""}));
+                                           BootModeCase{"none", false, ""}),
+                         [](const ::testing::TestParamInfo<BootModeCase>& info) {
+                             return case_name(info, info.param.option);
+                         });
 
 TEST(EmulatorTest, TwoPhonesDoNotSeeEachOther) {
     EmuPhone a;
@@ -296,6 +311,9 @@ struct AccessCase {
     bool allowed;
 };
 
+void PrintTo(const AccessCase& c, std::ostream* os) { *os << c.what; }
+
+
 class DaemonIdentityTest : public ::testing::TestWithParam<AccessCase> {};
 
 TEST_P(DaemonIdentityTest, WritesWhereItMustAndNowhereElse) {
@@ -325,7 +343,8 @@ INSTANTIATE_TEST_SUITE_P(
         AccessCase{"persist property", "setprop persist.emu.by_daemon 1", false},
         AccessCase{"stored properties", "ls /data/property", false},
         AccessCase{"system", "touch /system/etc/probe", false},
-        AccessCase{"boot mode", "echo 1 > /sys/class/BOOT/BOOT/boot/boot_mode", false}));
+        AccessCase{"boot mode", "echo 1 > /sys/class/BOOT/BOOT/boot/boot_mode", false}),
+    [](const ::testing::TestParamInfo<AccessCase>& info) { return case_name(info, info.param.what); });
 
 TEST(EmulatorTest, DaemonIsRestartedAfterItEnds) {
     EmuPhone phone;
