@@ -21,7 +21,12 @@ static const char HEADER_PREFIX[] = "-----timezone: ";
 // One record per file for failed data writes: a full disk fails every node.
 static bool write_failure_recorded[LOG_TYPE_COUNT];
 
-static int type_of(const LogFile* entry) { return static_cast<int>(entry - log_files); }
+// Forgets a file's recorded write failure; entries outside the table have none.
+static void reset_write_failure(const LogFile* entry) {
+    if (entry >= log_files && entry < log_files + LOG_TYPE_COUNT) {
+        write_failure_recorded[entry - log_files] = false;
+    }
+}
 
 int format_header(char* out, size_t n, const char* timezone) {
     static std::atomic<bool> cut_recorded{false};
@@ -165,7 +170,7 @@ int rotate_log_files(LogFile* entry) {
     }
     entry->fd = open_log_file(entry->name);
     entry->size = 0;
-    write_failure_recorded[type_of(entry)] = false;
+    reset_write_failure(entry);
     if (entry->fd < 0) {
         int err = errno;
         HLOG(TAG_TRANSIST, WLOG_ERROR, "couldn't open output file %s,(%d)%s", entry->name, err,
