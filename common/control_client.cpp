@@ -40,7 +40,8 @@ const char* control_result_text(int result) {
 }
 
 int control_server_trusted(uid_t uid) {
-    return uid == static_cast<uid_t>(CONTROL_UID_ROOT) || uid == static_cast<uid_t>(CONTROL_UID_SHELL);
+    return uid == static_cast<uid_t>(CONTROL_UID_ROOT) ||
+           uid == static_cast<uid_t>(CONTROL_UID_SHELL);
 }
 
 static long long now_ms() {
@@ -229,7 +230,8 @@ int control_read_reply(ControlConnection* conn, const char* cmd, char* reply, si
                 return CC_OK;
             }
             // The reply may still be on its way (it can begin like a broadcast word).
-            if (rest_len < reply_len && memcmp(rest, expected, rest_len < expected_len ? rest_len : expected_len) == 0 &&
+            if (rest_len < reply_len &&
+                memcmp(rest, expected, rest_len < expected_len ? rest_len : expected_len) == 0 &&
                 (rest_len <= expected_len || rest[expected_len] == ',')) {
                 need_more = true;
                 break;
@@ -259,7 +261,8 @@ int control_next_event(ControlConnection* conn, char* out, size_t n, int timeout
                 len = 1;
                 while (len < conn->pending_len) {
                     bool ignored;
-                    if (broadcast_at(conn->pending + len, conn->pending_len - len, &ignored) > 0) break;
+                    if (broadcast_at(conn->pending + len, conn->pending_len - len, &ignored) > 0)
+                        break;
                     len++;
                 }
             }

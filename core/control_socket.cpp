@@ -37,8 +37,8 @@ static void* control_thread(void* arg) {
 }
 
 void start_control_socket(LogController* controller) {
-    int fd = socket_local_server(CONTROL_SOCKET_NAME, ANDROID_SOCKET_NAMESPACE_ABSTRACT,
-                                 SOCK_STREAM);
+    int fd =
+        socket_local_server(CONTROL_SOCKET_NAME, ANDROID_SOCKET_NAMESPACE_ABSTRACT, SOCK_STREAM);
     if (fd < 0) {
         HLOG(TAG_MAIN, WLOG_ERROR, "create socket 'tavlologd' failed");
         report_system_warning(1);

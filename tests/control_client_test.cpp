@@ -112,11 +112,11 @@ TEST(ControlClientProtocol, ExpectedReply) {
         {"stopped", "stop"},
         {"copy", "copy"},
         {"HBR_SHUTDOWN", "HBR_SHUTDOWN"},
-        {"star", "star"},                      // no word: a configuration message
-        {"KernelLog=0  ", "KernelLog=0"},      // trailing spaces go
-        {"  logsize=200", "  logsize=200"},    // leading spaces stay
-        {" ", " "},                            // the first character always stays
-        {"hbr_shutdown", "hbr_shutdown"},      // words are case-sensitive
+        {"star", "star"},                    // no word: a configuration message
+        {"KernelLog=0  ", "KernelLog=0"},    // trailing spaces go
+        {"  logsize=200", "  logsize=200"},  // leading spaces stay
+        {" ", " "},                          // the first character always stays
+        {"hbr_shutdown", "hbr_shutdown"},    // words are case-sensitive
     };
     for (const Case& c : cases) {
         char reply[CONTROL_REPLY_MAX + 1];
@@ -156,13 +156,19 @@ TEST(ControlClient, ReplyAmongBroadcasts) {
         {"plain", "start", {"start,1"}, "start,1", {}},
         {"failed", "copy", {"copy,0"}, "copy,0", {}},
         {"broadcast before", "stop", {"storage_fullstop,1"}, "stop,1", {"storage_full"}},
-        {"broadcasts around", "stop", {"tqlog_stoppedstop,1log_folder_lost"}, "stop,1",
+        {"broadcasts around",
+         "stop",
+         {"tqlog_stoppedstop,1log_folder_lost"},
+         "stop,1",
          {"tqlog_stopped", "log_folder_lost"}},
         {"reply in pieces", "deep_start", {"deep_", "start", ",1"}, "deep_start,1", {}},
         {"broadcast in pieces", "stop", {"storage_", "fullstop,1"}, "stop,1", {"storage_full"}},
         {"config echo", "KernelLog=0 ", {"KernelLog=0,1"}, "KernelLog=0,1", {}},
-        {"config echo like a broadcast", "storage_full=1", {"storage_full", "storage_full=1,1"},
-         "storage_full=1,1", {"storage_full"}},
+        {"config echo like a broadcast",
+         "storage_full=1",
+         {"storage_full", "storage_full=1,1"},
+         "storage_full=1,1",
+         {"storage_full"}},
     };
     for (const Case& c : cases) {
         SCOPED_TRACE(c.name);
@@ -198,7 +204,8 @@ TEST(ControlClient, RefusesBadCommands) {
     ControlConnection conn;
     ASSERT_EQ(CC_OK, control_connect(&conn, 2000));
     EXPECT_EQ(CC_BAD_COMMAND, control_send(&conn, "", 1000));
-    EXPECT_EQ(CC_BAD_COMMAND, control_send(&conn, std::string(CONTROL_CMD_MAX + 1, 'a').c_str(), 1000));
+    EXPECT_EQ(CC_BAD_COMMAND,
+              control_send(&conn, std::string(CONTROL_CMD_MAX + 1, 'a').c_str(), 1000));
     EXPECT_EQ(CC_BAD_COMMAND, control_send(&conn, "logsize=1\nlogpath=/x", 1000));
     EXPECT_EQ(CC_BAD_COMMAND, control_send(&conn, "a\x7f", 1000));
     // The longest command that fits the daemon's read goes out.
@@ -343,10 +350,12 @@ TEST(Tavlologctl, StatusFromProperties) {
     EXPECT_EQ(0, run("tavlologctl status", &out));
     EXPECT_EQ("running: no\nrun folder: none\nrotation size: unknown\n", out);
     ASSERT_EQ(0, property_set("debug.TQ.running", "1"));
-    ASSERT_EQ(0, property_set("debug.TQ.realpath", "/mnt/sdcard/qrvlog/tavlolog/APLog_2026_0304_070649/"));
+    ASSERT_EQ(0, property_set("debug.TQ.realpath",
+                              "/mnt/sdcard/qrvlog/tavlolog/APLog_2026_0304_070649/"));
     ASSERT_EQ(0, property_set("debug.TQ.logsize", "2457"));
     EXPECT_EQ(0, run("tavlologctl status", &out));
-    EXPECT_EQ("running: yes\nrun folder: /mnt/sdcard/qrvlog/tavlolog/APLog_2026_0304_070649/\n"
-              "rotation size: 2457 KB\n",
-              out);
+    EXPECT_EQ(
+        "running: yes\nrun folder: /mnt/sdcard/qrvlog/tavlolog/APLog_2026_0304_070649/\n"
+        "rotation size: 2457 KB\n",
+        out);
 }

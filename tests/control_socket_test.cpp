@@ -64,7 +64,8 @@ void write_config(const std::string& content) {
 std::string config_value(const std::string& key) {
     std::string all = read_file(CONFIG_FILE);
     size_t at = all.find(key + "=");
-    while (at != std::string::npos && at != 0 && all[at - 1] != '\n') at = all.find(key + "=", at + 1);
+    while (at != std::string::npos && at != 0 && all[at - 1] != '\n')
+        at = all.find(key + "=", at + 1);
     if (at == std::string::npos) return "(none)";
     size_t begin = at + key.size() + 1;
     return all.substr(begin, all.find('\n', begin) - begin);
@@ -195,7 +196,8 @@ TEST_F(ControlSocketTest, InvalidMessagesLeaveTheFileAlone) {
     start();
     auto conn = connect_client();
     for (const char* cmd : {"sublogKernelLog=0", "KernelLog", "logpath=/a\x01", "=1"}) {
-        EXPECT_EQ(std::string(cmd) + REPLY_DONE, exchange_raw(conn.get(), std::string(cmd) + '\0', cmd));
+        EXPECT_EQ(std::string(cmd) + REPLY_DONE,
+                  exchange_raw(conn.get(), std::string(cmd) + '\0', cmd));
     }
     EXPECT_EQ(kBaseConfig, read_file(CONFIG_FILE));
 }
@@ -209,10 +211,12 @@ TEST_F(ControlSocketTest, OverlongMessageIsReadInBoundedPieces) {
     ASSERT_EQ(CC_OK, control_send_raw(conn.get(), bytes.data(), bytes.size(), kTimeoutMs));
     char reply[CONTROL_REPLY_MAX + 1];
     std::string first(CONTROL_MSG_MAX - 1, 'a');
-    ASSERT_EQ(CC_OK, control_read_reply(conn.get(), first.c_str(), reply, sizeof(reply), kTimeoutMs));
+    ASSERT_EQ(CC_OK,
+              control_read_reply(conn.get(), first.c_str(), reply, sizeof(reply), kTimeoutMs));
     EXPECT_EQ(first + REPLY_DONE, reply);
     std::string second(300 - CONTROL_MSG_MAX - 1, 'a');
-    ASSERT_EQ(CC_OK, control_read_reply(conn.get(), second.c_str(), reply, sizeof(reply), kTimeoutMs));
+    ASSERT_EQ(CC_OK,
+              control_read_reply(conn.get(), second.c_str(), reply, sizeof(reply), kTimeoutMs));
     EXPECT_EQ(second + REPLY_DONE, reply);
     EXPECT_EQ("x,1", exchange(conn.get(), "x"));
 }
@@ -259,8 +263,8 @@ TEST_F(ControlSocketTest, CommandsWhileRunning) {
 
 // A start whose folder cannot be made answers ",0" and drops the client.
 TEST_F(ControlSocketTest, StartFailsWithoutFolder) {
-    write_config(std::string(kBaseConfig).replace(12, strlen("logpath=internal_sd"),
-                                                  "logpath=/proc/tqlog"));
+    write_config(
+        std::string(kBaseConfig).replace(12, strlen("logpath=internal_sd"), "logpath=/proc/tqlog"));
     ASSERT_EQ("/proc/tqlog", config_value("logpath"));
     start();
     for (const char* word : {"start", "deep_start", "copy"}) {
@@ -414,7 +418,8 @@ TEST_F(ControlSocketTest, DescriptorsAreCloseOnExecAndThreadIsNamed) {
     DIR* tasks = opendir("/proc/self/task");
     ASSERT_NE(nullptr, tasks);
     while (struct dirent* entry = readdir(tasks)) {
-        std::string comm = read_file(("/proc/self/task/" + std::string(entry->d_name) + "/comm").c_str());
+        std::string comm =
+            read_file(("/proc/self/task/" + std::string(entry->d_name) + "/comm").c_str());
         if (comm == "tavlo.control\n") named = true;
     }
     closedir(tasks);
@@ -428,8 +433,8 @@ TEST_F(ControlSocketTest, TavlologctlAgainstTheDaemon) {
     EXPECT_EQ("KernelLog=0,1\n", out);
     EXPECT_EQ("0", config_value("KernelLog"));
 
-    write_config(std::string(kBaseConfig).replace(12, strlen("logpath=internal_sd"),
-                                                  "logpath=/proc/tqlog"));
+    write_config(
+        std::string(kBaseConfig).replace(12, strlen("logpath=internal_sd"), "logpath=/proc/tqlog"));
     EXPECT_EQ(1, run("tavlologctl start", &out)) << out;
     EXPECT_EQ("start,0\n", out);
 
@@ -457,8 +462,9 @@ TEST_F(ControlSocketTest, TavlologctlAgainstTheDaemon) {
 // A whole run driven by commands, with every collector off so that nothing
 // but the transist runs: start, a second start, copy, stop.
 TEST_F(ControlSocketTest, StartCopyStopWithoutCollectors) {
-    write_config("autostart=0\nlogpath=/mnt/sdcard\nlogsize=300\nAndroidLog=0\nKernelLog=0\n"
-                 "BTLog=0\ntotallogsize=600\n");
+    write_config(
+        "autostart=0\nlogpath=/mnt/sdcard\nlogsize=300\nAndroidLog=0\nKernelLog=0\n"
+        "BTLog=0\ntotallogsize=600\n");
     start();
     auto conn = connect_client();
     EXPECT_EQ("start,1", exchange(conn.get(), "start"));
