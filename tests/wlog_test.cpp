@@ -4,6 +4,8 @@
 
 #include <errno.h>
 #include <fcntl.h>
+#include <ctype.h>
+#include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
 #include <sys/stat.h>
@@ -12,7 +14,6 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <regex>
 #include <string>
 #include <thread>
 #include <vector>
@@ -56,6 +57,38 @@ std::string message_of(const std::string& line) {
     return at == std::string::npos ? std::string() : line.substr(at + 2);
 }
 
+// The fields of "MM-DD HH:MM:SS.mmm  PID  TID P TAG: message".
+struct Line {
+    int month, day, hour, minute, second;
+    int pid, tid;
+    char priority;
+    std::string tag;  // without the padding
+    std::string message;
+};
+
+bool parse_line(const std::string& text, Line* out) {
+    static const char kStamp[] = "dd-dd dd:dd:dd.ddd ";
+    if (text.size() < sizeof(kStamp)) return false;
+    for (size_t i = 0; i + 1 < sizeof(kStamp); i++) {
+        bool digit = isdigit(static_cast<unsigned char>(text[i])) != 0;
+        if (kStamp[i] == 'd' ? !digit : text[i] != kStamp[i]) return false;
+    }
+    int consumed = 0;
+    int ms = 0;
+    if (sscanf(text.c_str(), "%2d-%2d %2d:%2d:%2d.%3d %d %d %c %n", &out->month, &out->day,
+               &out->hour, &out->minute, &out->second, &ms, &out->pid, &out->tid, &out->priority,
+               &consumed) != 9 ||
+        consumed == 0)
+        return false;
+    std::string rest = text.substr(static_cast<size_t>(consumed));
+    size_t colon = rest.find(": ");
+    if (colon == std::string::npos) return false;
+    out->tag = rest.substr(0, colon);
+    while (!out->tag.empty() && out->tag.back() == ' ') out->tag.pop_back();
+    out->message = rest.substr(colon + 2);
+    return true;
+}
+
 class WlogTest : public ::testing::Test {
   protected:
     void SetUp() override {
@@ -69,22 +102,22 @@ TEST_F(WlogTest, LineHasTheThreadtimeShape) {
     WLOG(TAG_DEBUG, WLOG_INFO, "hello %d %s", 42, "world");
     std::vector<std::string> lines = read_lines();
     ASSERT_EQ(1u, lines.size());
-    std::smatch m;
-    ASSERT_TRUE(std::regex_match(lines[0], m,
-                                 std::regex("(\\d\\d)-(\\d\\d) (\\d\\d):(\\d\\d):(\\d\\d)\\.\\d\\d\\d +"
-                                            "(\\d+) +(\\d+) I TavloLogD/DEBUG: hello 42 world")))
-        << lines[0];
-    EXPECT_EQ(std::to_string(getpid()), m[6].str());
-    EXPECT_EQ(std::to_string(gettid()), m[7].str());
+    Line l;
+    ASSERT_TRUE(parse_line(lines[0], &l)) << lines[0];
+    EXPECT_EQ(getpid(), l.pid);
+    EXPECT_EQ(gettid(), l.tid);
+    EXPECT_EQ('I', l.priority);
+    EXPECT_EQ("TavloLogD/DEBUG", l.tag);
+    EXPECT_EQ("hello 42 world", l.message);
     // The stamp is the local time of now (the date is computed by hand).
     time_t now = time(nullptr);
     struct tm tm;
     localtime_r(&now, &tm);
-    tm.tm_mon = std::stoi(m[1]) - 1;
-    tm.tm_mday = std::stoi(m[2]);
-    tm.tm_hour = std::stoi(m[3]);
-    tm.tm_min = std::stoi(m[4]);
-    tm.tm_sec = std::stoi(m[5]);
+    tm.tm_mon = l.month - 1;
+    tm.tm_mday = l.day;
+    tm.tm_hour = l.hour;
+    tm.tm_min = l.minute;
+    tm.tm_sec = l.second;
     tm.tm_isdst = -1;
     EXPECT_LE(llabs(static_cast<long long>(difftime(mktime(&tm), now))), 5) << lines[0];
 }
@@ -215,13 +248,12 @@ TEST_F(WlogTest, ConcurrentWritersNeverInterleave) {
 
     std::vector<std::string> lines = read_lines();
     EXPECT_EQ(7u * kLinesPerWriter, lines.size());
-    const std::regex shape("\\d\\d-\\d\\d \\d\\d:\\d\\d:\\d\\d\\.\\d{3} +\\d+ +\\d+ D TavloLogD/Transist: (.*)");
     int bad = 0;
     for (const auto& line : lines) {
-        std::smatch m;
-        bool ok = std::regex_match(line, m, shape);
+        Line l;
+        bool ok = parse_line(line, &l) && l.priority == 'D' && l.tag == "TavloLogD/Transist";
         if (ok) {
-            std::string msg = m[1];
+            const std::string& msg = l.message;
             char letter = msg.empty() ? 0 : msg[0];
             ok = msg.size() == 1 + 4 + 1 + 700 && msg.substr(6) == std::string(700, letter);
         }
