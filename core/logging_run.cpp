@@ -228,11 +228,12 @@ static void kill_collectors(LogController* controller) {
     }
 }
 
-static void join_transist_thread(pthread_t thread, const char* which) {
+static void join_transist_thread(pthread_t* thread, const char* which) {
     void* result = nullptr;
     // A thread the transist could not create has the zero handle; joining it
-    // would crash the daemon.
-    int rc = pthread_equal(thread, pthread_t()) ? ESRCH : pthread_join(thread, &result);
+    // (or joining one twice) would crash the daemon.
+    int rc = pthread_equal(*thread, pthread_t()) ? ESRCH : pthread_join(*thread, &result);
+    *thread = pthread_t();
     if (rc != 0) {
         if (strcmp(which, "read") == 0) {
             HLOG(TAG_MAIN, WLOG_ERROR, "cannot join with read thread (%s)%d", strerror(rc), rc);
@@ -281,8 +282,8 @@ void stop_logging(LogController* controller) {
     // it reads the connections to their end and writes every queued byte.
     stop_requested = true;
     transist_wake();
-    join_transist_thread(read_thread_id, "read");
-    join_transist_thread(write_thread_id, "write");
+    join_transist_thread(&read_thread_id, "read");
+    join_transist_thread(&write_thread_id, "write");
     stop_requested = false;
     HLOG(TAG_MAIN, WLOG_INFO, "tavlolog stop done");
 }

@@ -3,6 +3,7 @@
 // real kernel collector reading a FIFO that stands in for /proc/kmsg.
 #include <errno.h>
 #include <fcntl.h>
+#include <limits.h>
 #include <poll.h>
 #include <signal.h>
 #include <stdint.h>
@@ -18,7 +19,6 @@
 
 #include <gtest/gtest.h>
 
-#include <regex>
 #include <string>
 #include <thread>
 
@@ -27,6 +27,7 @@
 #include "core/child_supervision.h"
 #include "core/log_controller.h"
 #include "core/logging_run.h"
+#include "transist/transist.h"
 #include "platform/properties.h"
 #include "platform/property_area.h"
 
@@ -105,8 +106,18 @@ TEST(ComposeRunFolder, NamesTheFolderAfterTheStartTime) {
     strcpy(controller.logpath, "/mnt/sdcard");
     compose_run_folder(&controller);
     std::string folder = controller.run_folder;
-    EXPECT_TRUE(std::regex_match(folder, std::regex("/mnt/sdcard/qrvlog/tavlolog/APLog_20[0-9]{2}_[01][0-9][0-3][0-9]_[0-2][0-9][0-5][0-9][0-6][0-9]/")))
-        << folder;
+    const std::string root = "/mnt/sdcard/qrvlog/tavlolog/";
+    ASSERT_EQ(folder.compare(0, root.size(), root), 0) << folder;
+    std::string name = folder.substr(root.size());
+    EXPECT_EQ(name.size(), strlen("APLog_2026_0304_070649/")) << name;
+    struct tm when = {};
+    const char* rest = strptime(name.c_str(), "APLog_%Y_%m%d_%H%M%S/", &when);
+    ASSERT_NE(rest, nullptr) << name;
+    EXPECT_EQ(*rest, '\0') << name;
+    time_t now = time(nullptr);
+    struct tm local;
+    localtime_r(&now, &local);
+    EXPECT_EQ(when.tm_year, local.tm_year);
     EXPECT_TRUE(history_has("full path is:" + folder));
 }
 
@@ -313,6 +324,61 @@ TEST_F(RunTest, StopKeepsEverythingTheCollectorSent) {
     EXPECT_TRUE(history_has("tavlolog stop done"));
     // The stop did not leave a collector behind.
     EXPECT_NE(kill(collector, 0), 0);
+}
+
+std::string fd_target(pid_t pid, int fd) {
+    char link[64], target[PATH_MAX] = {};
+    snprintf(link, sizeof(link), "/proc/%d/fd/%d", pid, fd);
+    if (readlink(link, target, sizeof(target) - 1) < 0) return "";
+    return target;
+}
+
+// The collector must not keep the run's files, the listening sockets or the
+// clients' connections open: they would outlive the daemon's own close.
+TEST_F(RunTest, CollectorKeepsNoneOfTheDaemonsDescriptors) {
+    int client[2];
+    ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, client), 0);
+    controller_.clients[0].fd = client[0];
+    start_logging(&controller_);
+    ASSERT_GT(controller_.klog_pid, 0);
+    feed("x\n");
+    ASSERT_TRUE(wait_source_drained());
+
+    const std::string forbidden[] = {
+        fd_target(getpid(), transist_listen_fd),
+        fd_target(getpid(), client[0]),
+        fd_target(getpid(), log_files[LOG_KERNEL].fd),
+    };
+    for (const std::string& target : forbidden) ASSERT_NE(target, "");
+    int open_count = 0;
+    for (int fd = 0; fd < 1024; fd++) {
+        std::string target = fd_target(controller_.klog_pid, fd);
+        if (target.empty()) continue;
+        open_count++;
+        for (const std::string& bad : forbidden) EXPECT_NE(target, bad) << "fd " << fd;
+    }
+    EXPECT_GT(open_count, 0);
+    stop_logging(&controller_);
+    controller_.clients[0].fd = -1;
+    close(client[0]);
+    close(client[1]);
+}
+
+TEST_F(RunTest, SwitchMovesTheRunningFilesToTheNewFolder) {
+    start_logging(&controller_);
+    feed("first\n");
+    ASSERT_TRUE(wait_source_drained());
+    ASSERT_EQ(create_run_folder(&controller_, "/data", "/data/run_moved/"), 1);
+    controller_.rotate_size_kb = 512;
+    switch_run_folder(&controller_, "/data/run_moved/");
+    EXPECT_EQ(property(PROP_REALPATH), "/data/run_moved/");
+    EXPECT_EQ(property(PROP_LOGSIZE), "512");
+    feed("second\n");
+    ASSERT_TRUE(wait_source_drained());
+    stop_logging(&controller_);
+    EXPECT_EQ(log_body("/data/run_test/kernel_log") + log_body("/data/run_moved/kernel_log"),
+              "first\nsecond\n");
+    EXPECT_NE(log_body("/data/run_moved/kernel_log").find("second\n"), std::string::npos);
 }
 
 TEST_F(RunTest, StopWithNoCollectorToWaitForIsQuick) {
