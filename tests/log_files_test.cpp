@@ -76,6 +76,7 @@ class LogFilesTest : public ::testing::Test {
     }
     void TearDown() override {
         for (LogFile& entry : log_files) close_log_file(&entry);
+        sync_retired_files();
     }
     // Opens the type's file in folder as a run would.
     void open_entry(int type, const std::string& folder) {

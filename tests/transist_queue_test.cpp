@@ -131,6 +131,40 @@ TEST(ReleaseHead, UnlinksOldestAndKeepsCountsRight) {
     queue_clear(&q);
 }
 
+TEST(NodePool, ReleasedNodesAreReusedUpToTheCapAndTrimmed) {
+    node_pool_trim(0);
+    TransistQueue q = {};
+    ASSERT_EQ(queue_append(&q, LOG_MAIN, "abc", 3, 4095), 1);
+    const LogBuffer* first = q.lists[LOG_MAIN].head;
+    release_head(&q.lists[LOG_MAIN]);
+    q.total = 0;
+    EXPECT_EQ(node_pool_bytes(), 4095);
+    ASSERT_EQ(queue_append(&q, LOG_KERNEL, "xy", 2, 4095), 1);
+    EXPECT_EQ(q.lists[LOG_KERNEL].head, first);  // the same block, emptied
+    EXPECT_EQ(list_content(q.lists[LOG_KERNEL]), "xy");
+    EXPECT_EQ(node_pool_bytes(), 0);
+    queue_clear(&q);
+
+    // A pooled node of another size is not handed out for this one.
+    ASSERT_EQ(queue_append(&q, LOG_MAIN, "abc", 3, 8192), 1);
+    EXPECT_EQ(q.lists[LOG_MAIN].head->cap, 8192);
+    queue_clear(&q);
+    node_pool_trim(0);
+    EXPECT_EQ(node_pool_bytes(), 0);
+
+    // However many nodes a burst released, the pool keeps at most its cap.
+    std::string chunk(65535, 'n');
+    for (int i = 0; i < 200; i++) {
+        ASSERT_EQ(queue_append(&q, LOG_BT, chunk.data(), 65535, 65535), 1);
+    }
+    queue_clear(&q);
+    EXPECT_LE(node_pool_bytes(), NODE_POOL_MAX_BYTES);
+    EXPECT_GT(node_pool_bytes(), NODE_POOL_MAX_BYTES - 65535);
+    node_pool_trim(3 * 65535);
+    EXPECT_EQ(node_pool_bytes(), 3 * 65535);
+    node_pool_trim(0);
+}
+
 TEST(QueueRoles, RotationCyclesFillDrainSpare) {
     reset_queue_roles();
     TransistQueue* first = &transist_queues[0];

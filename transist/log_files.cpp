@@ -154,8 +154,36 @@ void close_log_file(LogFile* entry) {
     entry->fd = -1;
 }
 
-int rotate_log_files(LogFile* entry) {
+// Rotated-out files wait here for their sync, which the writer does after it
+// has let go of the file table: a sync can take many milliseconds, and the
+// reader needs the table to go on taking the collectors' data meanwhile.
+static int retired_fds[16];  // file_table_lock
+static int retired_count = 0;  // file_table_lock
+
+static void retire_log_file(LogFile* entry) {
+    if (entry->fd > 0 && retired_count < static_cast<int>(sizeof(retired_fds) / sizeof(int))) {
+        retired_fds[retired_count++] = entry->fd;
+        entry->fd = -1;
+        return;
+    }
     close_log_file(entry);
+}
+
+void sync_retired_files() {
+    int fds[sizeof(retired_fds) / sizeof(int)];
+    pthread_mutex_lock(&file_table_lock);
+    int count = retired_count;
+    memcpy(fds, retired_fds, sizeof(int) * static_cast<size_t>(count));
+    retired_count = 0;
+    pthread_mutex_unlock(&file_table_lock);
+    for (int i = 0; i < count; i++) {
+        RETRY_EINTR(fsync(fds[i]));
+        close(fds[i]);
+    }
+}
+
+int rotate_log_files(LogFile* entry) {
+    retire_log_file(entry);
     char from[PATH_LEN + 8];
     char to[PATH_LEN + 8];
     for (int i = 4; i >= 1; i--) {

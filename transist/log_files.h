@@ -38,8 +38,13 @@ bool rotation_due(int64_t size, int limit_kb);
 int write_log_data(int type, const char* buf, int len);
 
 // Renames X.3 -> X.4 ... X -> X.1 and opens a fresh X. Returns 0, or -1 when X
-// could not be reopened (recorded; the entry then has no file).
+// could not be reopened (recorded; the entry then has no file). The old X is
+// synced and closed by the next sync_retired_files.
 int rotate_log_files(LogFile* entry);
+
+// Syncs and closes the files rotation has set aside. Takes file_table_lock
+// only to pick them up; call it without holding it.
+void sync_retired_files();
 
 // Syncs and closes the type's file for good and marks it closed.
 void close_log_file(LogFile* entry);

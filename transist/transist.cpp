@@ -205,6 +205,7 @@ static void discard_leftovers() {
     reset_queue_roles();
     reader_paused = false;
     pthread_mutex_unlock(&queue_lock);
+    node_pool_trim(0);
 }
 
 // The server socket is made here, before the collectors are forked, so that

@@ -11,8 +11,75 @@ TransistQueue* spare_queue = &transist_queues[1];
 TransistQueue* drain_queue = &transist_queues[2];
 pthread_mutex_t queue_lock = PTHREAD_MUTEX_INITIALIZER;
 
+// Free nodes for reuse; pool_lock is a leaf lock, taken inside any other.
+static pthread_mutex_t pool_lock = PTHREAD_MUTEX_INITIALIZER;
+static LogBuffer* pool_head = nullptr;  // pool_lock
+static int pool_bytes = 0;              // pool_lock
+
+static LogBuffer* pooled_node(int capacity) {
+    pthread_mutex_lock(&pool_lock);
+    LogBuffer* node = pool_head;
+    // A node of another size is left from a run with another buffersize;
+    // it goes at the next trim.
+    if (node != nullptr && node->cap == capacity) {
+        pool_head = node->next;
+        pool_bytes -= node->cap;
+    } else {
+        node = nullptr;
+    }
+    pthread_mutex_unlock(&pool_lock);
+    return node;
+}
+
+static void free_node(LogBuffer* node) {
+    pthread_mutex_lock(&pool_lock);
+    bool kept = pool_bytes + node->cap <= NODE_POOL_MAX_BYTES;
+    if (kept) {
+        node->next = pool_head;
+        pool_head = node;
+        pool_bytes += node->cap;
+    }
+    pthread_mutex_unlock(&pool_lock);
+    if (!kept) {
+        free(node->buf);
+        free(node);
+    }
+}
+
+void node_pool_trim(int keep_bytes) {
+    LogBuffer* spill = nullptr;
+    pthread_mutex_lock(&pool_lock);
+    while (pool_head != nullptr && pool_bytes > keep_bytes) {
+        LogBuffer* node = pool_head;
+        pool_head = node->next;
+        pool_bytes -= node->cap;
+        node->next = spill;
+        spill = node;
+    }
+    pthread_mutex_unlock(&pool_lock);
+    while (spill != nullptr) {
+        LogBuffer* next = spill->next;
+        free(spill->buf);
+        free(spill);
+        spill = next;
+    }
+}
+
+int node_pool_bytes() {
+    pthread_mutex_lock(&pool_lock);
+    int bytes = pool_bytes;
+    pthread_mutex_unlock(&pool_lock);
+    return bytes;
+}
+
 static LogBuffer* new_node(int capacity) {
-    LogBuffer* node = static_cast<LogBuffer*>(malloc(sizeof(LogBuffer)));
+    LogBuffer* node = pooled_node(capacity);
+    if (node != nullptr) {
+        node->len = 0;
+        node->next = nullptr;
+        return node;
+    }
+    node = static_cast<LogBuffer*>(malloc(sizeof(LogBuffer)));
     if (node == nullptr) return nullptr;
     node->buf = static_cast<char*>(malloc(static_cast<size_t>(capacity)));
     if (node->buf == nullptr) {
@@ -57,8 +124,7 @@ void release_head(BufferList* list) {
     list->head = node->next;
     if (list->tail == node) list->tail = nullptr;
     list->bytes -= node->len;
-    free(node->buf);
-    free(node);
+    free_node(node);
 }
 
 int queue_clear(TransistQueue* q) {

@@ -54,7 +54,20 @@ extern pthread_mutex_t queue_lock;
 int queue_append(TransistQueue* q, int type, const char* data, int n, int capacity);
 
 // Unlinks and frees the first node of list, keeping bytes, head and tail right.
+// Freed nodes are kept for reuse (see node_pool_trim).
 void release_head(BufferList* list);
+
+// Released nodes wait here for the reader's next allocations, up to this many
+// bytes: handing 64 KB blocks back to the system and faulting them in again
+// costs the transist more than moving the log data itself.
+constexpr int NODE_POOL_MAX_BYTES = 8 << 20;
+
+// Frees pooled nodes beyond keep_bytes (the writer keeps what its last cycle
+// needed, so a burst's memory goes back once the burst is over).
+void node_pool_trim(int keep_bytes);
+
+// Bytes held by pooled nodes.
+int node_pool_bytes();
 
 // Frees every node of q; returns the byte count it held (its total).
 int queue_clear(TransistQueue* q);

@@ -76,6 +76,7 @@ int flush_queue() {
     pthread_mutex_lock(&file_table_lock);
     int rc = flush_one_queue(drain_queue, true);
     pthread_mutex_unlock(&file_table_lock);
+    sync_retired_files();
     return rc;
 }
 
@@ -116,6 +117,7 @@ static int finish_at_stop() {
     }
     close_all_log_files();
     pthread_mutex_unlock(&file_table_lock);
+    sync_retired_files();
     return rc == FLUSH_REOPEN_FAILED ? 1 : 2;
 }
 
@@ -136,15 +138,22 @@ void* write_thread(void*) {
         reader_paused = false;
         pthread_mutex_unlock(&queue_lock);
         if (resume_reader) wake_reader();
+        int pooled = node_pool_bytes();
         if (drain_queue->total != 0 && flush_queue() == FLUSH_REOPEN_FAILED) {
             writer_running = false;
             close_files_only();
+            node_pool_trim(0);
             return reinterpret_cast<void*>(1);
         }
+        // Keep as many spare nodes as this cycle released: the next cycle
+        // likely needs as many, and an idle cycle gives them all back.
+        int released = node_pool_bytes() - pooled;
+        node_pool_trim(released > 0 ? released : 0);
         int64_t elapsed = monotonic_us() - t0;
         if (elapsed >= 0 && elapsed <= interval_us) writer_sleep_us(interval_us - elapsed);
     }
     int rc = finish_at_stop();
+    node_pool_trim(0);
     writer_running = false;
     WLOG(TAG_TRANSIST, WLOG_DEBUG, "write_thread exits");
     return reinterpret_cast<void*>(static_cast<intptr_t>(rc));
