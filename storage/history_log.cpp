@@ -60,8 +60,9 @@ void make_printable(char* s) {
     }
 }
 
-// Runs in every forked child: the parent's other threads are gone, one of
-// them may have held the lock at the fork.
+// Registered when the program loads, so every fork is covered, also those of
+// code that does not know about the history log: in the child the parent's
+// other threads are gone, and one of them may have held the lock.
 __attribute__((constructor)) void register_history_fork_handler() {
     pthread_atfork(nullptr, nullptr, history_log_after_fork);
 }

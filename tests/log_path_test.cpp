@@ -112,13 +112,6 @@ TEST_F(LogPathTest, OverlongValueIsCutInsideTheBuffer) {
     for (size_t i = CONFIG_FIELD_LEN; i < sizeof(out); i++) EXPECT_EQ(out[i], 'X') << "overrun at " << i;
 }
 
-TEST_F(LogPathTest, LongestPropertyValueIsKeptWhole) {
-    std::string dir = "/" + std::string(PROPERTY_VALUE_MAX - 2, 's');
-    ASSERT_EQ(property_set("external_sd_path", dir.c_str()), 0);
-    char out[CONFIG_FIELD_LEN];
-    EXPECT_EQ(std::string(resolve_log_path("external_sd", out)), dir);
-}
-
 TEST_F(LogPathTest, OverrideRewritesTheFileAndResolvesLater) {
     write_file(CONFIG_FILE, config_with_logpath("internal_sd"));
     ASSERT_EQ(property_set(kOverride, "external_sd"), 0);
