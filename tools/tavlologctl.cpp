@@ -5,6 +5,8 @@
 //                                          print each broadcast on its own line
 //                                          until the daemon closes the connection
 //   tavlologctl status                     the daemon's state from its properties
+//   tavlologctl [-t SECONDS] --raw TEXT    (tests) send TEXT's bytes exactly, with no
+//                                          terminator, and print the first answer
 //
 // Exit status: 0 reply ",1" (or listening ended normally), 1 reply ",0",
 // 2 the daemon cannot be reached, is not trusted, does not answer in time,
@@ -99,6 +101,21 @@ static int run_listen(const char* cmd, int timeout_ms) {
     }
 }
 
+// For tests of malformed messages: the daemon sees exactly these bytes.
+static int run_raw(const char* text, int timeout_ms) {
+    ControlConnection conn;
+    int rc = connect_to_daemon(&conn, timeout_ms);
+    if (rc != EXIT_DONE) return rc;
+    rc = control_send_raw(&conn, text, strlen(text), timeout_ms);
+    if (rc != CC_OK) return trouble("raw", rc);
+    char answer[CONTROL_RECV_MAX];
+    rc = control_next_event(&conn, answer, sizeof(answer), timeout_ms);
+    if (rc != CC_OK) return trouble("raw", rc);
+    printf("%s\n", answer);
+    fflush(stdout);
+    return exit_for_reply(answer);
+}
+
 static int run_status() {
     char running[PROPERTY_VALUE_MAX];
     char folder[PROPERTY_VALUE_MAX];
@@ -120,6 +137,7 @@ int main(int argc, char** argv) {
     int timeout_s = DEFAULT_TIMEOUT_S;
     bool listen = false;
     const char* send_cmd = nullptr;
+    const char* raw_text = nullptr;
     const char* command = nullptr;
 
     for (int i = 1; i < argc; i++) {
@@ -139,6 +157,9 @@ int main(int argc, char** argv) {
         } else if (strcmp(arg, "--send") == 0) {
             if (++i >= argc) return usage(), EXIT_TROUBLE;
             send_cmd = argv[i];
+        } else if (strcmp(arg, "--raw") == 0) {
+            if (++i >= argc) return usage(), EXIT_TROUBLE;
+            raw_text = argv[i];
         } else if (strcmp(arg, "-h") == 0 || strcmp(arg, "--help") == 0) {
             usage();
             return EXIT_DONE;
@@ -156,6 +177,10 @@ int main(int argc, char** argv) {
     if (command && strcmp(command, "listen") == 0) {
         listen = true;
         command = nullptr;
+    }
+    if (raw_text) {
+        if (listen || command || send_cmd || raw_text[0] == '\0') return usage(), EXIT_TROUBLE;
+        return run_raw(raw_text, timeout_ms);
     }
     if (listen) {
         if (command) return usage(), EXIT_TROUBLE;
