@@ -4,6 +4,7 @@
 
 #include <fstream>
 #include <sstream>
+#include <ostream>
 #include <string>
 
 #include "core/boot_mode.h"
@@ -22,6 +23,9 @@ struct BootModeCase {
     const char* content;
     int mode;
 };
+
+// Names the case in test output instead of dumping its bytes.
+void PrintTo(const BootModeCase& c, std::ostream* os) { *os << '"' << c.content << '"'; }
 
 class BootModeFile : public ::testing::TestWithParam<BootModeCase> {};
 

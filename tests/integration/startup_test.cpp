@@ -4,6 +4,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <ostream>
 #include <string>
 #include <vector>
 
@@ -119,6 +120,9 @@ struct BootModeCase {
     const char* file;  // content of the boot-mode file, "none" for no file
     const char* record;
 };
+
+// Names the case in test output instead of dumping its bytes.
+void PrintTo(const BootModeCase& c, std::ostream* os) { *os << '"' << c.file << '"'; }
 
 class StartupBootMode : public ::testing::TestWithParam<BootModeCase> {};
 
