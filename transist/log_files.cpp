@@ -212,7 +212,7 @@ int rotate_log_files(LogFile* entry) {
 void close_all_log_files() {
     for (LogFile& entry : log_files) {
         close_log_file(&entry);
-        if (entry.sock > 0) close(entry.sock);
+        if (entry.sock >= 0) close(entry.sock);
         entry.sock = -1;
         entry.name[0] = '\0';
     }

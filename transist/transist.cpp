@@ -251,6 +251,10 @@ void transist_create(LogController* controller, const char* run_folder, int rota
     reader_done = false;
     pthread_mutex_unlock(&wake_lock);
     writer_running = true;
+    // No connection yet; the table starts zeroed, and 0 is a descriptor.
+    pthread_mutex_lock(&file_table_lock);
+    for (LogFile& entry : log_files) entry.sock = -1;
+    pthread_mutex_unlock(&file_table_lock);
 
     open_listen_socket();
 

@@ -229,7 +229,7 @@ static void build_poll_set(PollSet* set, bool with_registered, bool with_control
     if (!with_registered) return;
     pthread_mutex_lock(&select_set_lock);
     for (int type = 0; type < LOG_TYPE_COUNT; type++) {
-        if (log_files[type].sock > 0) add_fd(set, log_files[type].sock, -1, type);
+        if (log_files[type].sock >= 0) add_fd(set, log_files[type].sock, -1, type);
     }
     pthread_mutex_unlock(&select_set_lock);
 }
@@ -265,7 +265,8 @@ static void handle_ready(const PollSet* set, int chunks_per_fd) {
 static bool queue_full() {
     pthread_mutex_lock(&queue_lock);
     bool was_paused = reader_paused;
-    reader_paused = fill_queue->total >= QUEUE_HIGH_WATER;
+    // Without a writer the queue never drains; the data is dropped instead.
+    reader_paused = writer_running && fill_queue->total >= QUEUE_HIGH_WATER;
     bool paused = reader_paused;
     pthread_mutex_unlock(&queue_lock);
     if (paused && !was_paused) kick_writer();
