@@ -288,10 +288,16 @@ void stop_logging(LogController* controller) {
     HLOG(TAG_MAIN, WLOG_INFO, "tavlolog stop done");
 }
 
+void publish_run_folder(const char* path) {
+    if (property_set(PROP_REALPATH, path) == 0) return;
+    // A folder longer than a property value can hold: the run's history records
+    // must not go on landing in the previous run's folder.
+    property_set(PROP_REALPATH, "");
+    HLOG(TAG_MAIN, WLOG_ERROR, "set %s to %s failed", PROP_REALPATH, path);
+}
+
 void switch_run_folder(LogController* controller, const char* path) {
-    if (property_set(PROP_REALPATH, path) < 0) {
-        HLOG(TAG_MAIN, WLOG_ERROR, "set %s to %s failed", PROP_REALPATH, path);
-    }
+    publish_run_folder(path);
     set_logsize_property(controller->rotate_size_kb);
     change_log_folder(path, controller->rotate_size_kb);
     sleep(1);

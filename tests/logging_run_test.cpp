@@ -179,6 +179,16 @@ TEST(CreateRunFolder, RefusesWhatCannotBeMade) {
 
 // A fake `oru` first on PATH records each call; the build flags are loaded
 // once per process, so every case runs in a child of its own.
+TEST(PublishRunFolder, AFolderTooLongForThePropertyClearsIt) {
+    publish_run_folder("/mnt/sdcard/qrvlog/tavlolog/APLog_2026_0304_070649/");
+    EXPECT_EQ(property("debug.TQ.realpath"), "/mnt/sdcard/qrvlog/tavlolog/APLog_2026_0304_070649/");
+    std::string long_folder = "/mnt/" + std::string(90, 'd') + "/qrvlog/tavlolog/APLog_2026_0304_070650/";
+    publish_run_folder(long_folder.c_str());
+    // The earlier run's folder must not receive this run's history records.
+    EXPECT_EQ(property("debug.TQ.realpath"), "");
+    EXPECT_TRUE(history_has("set debug.TQ.realpath to " + long_folder + " failed"));
+}
+
 TEST(OruMode, RunsTheEngineCommandsOnlyOffEngBuilds) {
     mkdir("/tmp/fakebin", 0755);
     FILE* script = fopen("/tmp/fakebin/oru", "w");
