@@ -3,7 +3,9 @@
 // the tuning values that size the nodes and pace the writer.
 #include "transist/transist_queue.h"
 
+#include <errno.h>
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 
 #include <string>
 #include <vector>
@@ -104,6 +106,32 @@ TEST(QueueAppend, TypesKeepSeparateLists) {
         EXPECT_EQ(list.tail, nullptr);
         EXPECT_EQ(list.bytes, 0);
     }
+}
+
+TEST(QueueAppend, FailedAllocationDropsTheChunkAndCopiesNothing) {
+#if defined(__SANITIZE_ADDRESS__)
+    GTEST_SKIP() << "an address-space limit breaks the sanitizer's shadow memory";
+#else
+    node_pool_trim(0);
+    TransistQueue q = {};
+    ASSERT_EQ(queue_append(&q, LOG_MAIN, "kept", 4, 4095), 1);
+    struct rlimit old_limit;
+    ASSERT_EQ(getrlimit(RLIMIT_AS, &old_limit), 0);
+    struct rlimit low = old_limit;
+    low.rlim_cur = 1ul << 30;  // far below what a 1.5 GB node needs on top
+    ASSERT_EQ(setrlimit(RLIMIT_AS, &low), 0);
+    const int huge = 1536 << 20;
+    errno = 0;
+    int rc = queue_append(&q, LOG_KERNEL, "lost", 4, huge);
+    int err = errno;
+    setrlimit(RLIMIT_AS, &old_limit);
+    EXPECT_EQ(rc, 0);
+    EXPECT_EQ(err, ENOMEM);
+    EXPECT_EQ(q.lists[LOG_KERNEL].head, nullptr);
+    EXPECT_EQ(q.total, 4);
+    EXPECT_EQ(list_content(q.lists[LOG_MAIN]), "kept");
+    queue_clear(&q);
+#endif
 }
 
 TEST(ReleaseHead, UnlinksOldestAndKeepsCountsRight) {

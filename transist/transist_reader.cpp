@@ -153,7 +153,9 @@ static void handle_pending(int slot) {
 }
 
 static void accept_connections() {
-    for (;;) {
+    // Bounded, so that a process connecting in a loop cannot keep the reader
+    // from the collectors' data.
+    for (int accepted = 0; accepted < MAX_PENDING; accepted++) {
         int fd = accept4(transist_listen_fd, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC);
         if (fd < 0) {
             int err = errno;
