@@ -364,6 +364,7 @@ TEST_F(TransistTest, RemovedFolderIsReportedAsLogFolderLost) {
     stop();
     // The stop notifies nobody; the unwritable bytes are discarded by the next run.
     EXPECT_EQ(read(efd_thread, &value, sizeof(value)), -1);
+    EXPECT_FALSE(history_has("no space to write log"));
     mkdir(kRun, 0770);
     start();
     EXPECT_TRUE(history_has("delete transist queue:"));

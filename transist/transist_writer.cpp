@@ -89,9 +89,10 @@ static void close_files_only() {
 
 // The storage gate at a stop looks at the files' own file system: the
 // controller's log root may already have been reset by then.
+// A file that is gone is left to the flush, which reports the lost folder.
 static int files_storage_low() {
     for (const LogFile& entry : log_files) {
-        if (entry.fd > 0) return is_storage_low(entry.name);
+        if (entry.fd > 0 && access(entry.name, F_OK) == 0) return is_storage_low(entry.name);
     }
     return 0;
 }
