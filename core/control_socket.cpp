@@ -189,13 +189,17 @@ void control_loop(LogController* controller) {
             serve_clients(controller, &readable);
         }
 
+        // Each counter is read once, before the record: HLOG evaluates its
+        // arguments for the history and again for the platform log.
         if (efd_chld > 0 && FD_ISSET(efd_chld, &readable)) {
-            HLOG(TAG_MAIN, WLOG_INFO, "recv efd_chld %llu", read_counter(efd_chld));
+            unsigned long long deaths = read_counter(efd_chld);
+            HLOG(TAG_MAIN, WLOG_INFO, "recv efd_chld %llu", deaths);
             check_children(controller);
         }
         if (efd_thread > 0 && FD_ISSET(efd_thread, &readable)) {
             // 1001 storage low, 1002 log folder lost (or their sum): either way the run ends.
-            HLOG(TAG_MAIN, WLOG_INFO, "recv efd_thread %llu", read_counter(efd_thread));
+            unsigned long long events = read_counter(efd_thread);
+            HLOG(TAG_MAIN, WLOG_INFO, "recv efd_thread %llu", events);
             stop_logging(controller);
         }
     }
