@@ -38,6 +38,18 @@ bool configure(EmuPhone& phone, const std::vector<std::string>& settings) {
 
 std::string history(const EmuPhone& phone) { return phone.read_file(kHistory); }
 
+std::string platform_log(const EmuPhone& phone) { return phone.read_file("/dev/emu/wlog"); }
+
+std::vector<std::string> after_each(const std::string& text, const std::string& needle) {
+    std::vector<std::string> found;
+    for (size_t at = text.find(needle); at != std::string::npos; at = text.find(needle, at + 1)) {
+        size_t from = at + needle.size();
+        size_t end = text.find('\n', from);
+        found.push_back(text.substr(from, end == std::string::npos ? std::string::npos : end - from));
+    }
+    return found;
+}
+
 bool wait_history(const EmuPhone& phone, const std::string& needle, int times, int timeout_ms) {
     return EmuPhone::wait_for([&] { return count(history(phone), needle) >= times; }, timeout_ms);
 }
@@ -122,4 +134,41 @@ std::string numbered_lines(const std::string& tag, int first, int n, int length)
         text.append(line, static_cast<size_t>(length));
     }
     return text;
+}
+
+// A few bytes around offset, control bytes escaped.
+static std::string excerpt(const std::string& text, size_t offset) {
+    size_t from = offset > 24 ? offset - 24 : 0;
+    std::string shown;
+    for (size_t i = from; i < text.size() && i < offset + 40; i++) {
+        unsigned char c = static_cast<unsigned char>(text[i]);
+        if (c >= 0x20 && c < 0x7f) {
+            shown += static_cast<char>(c);
+        } else {
+            char esc[8];
+            snprintf(esc, sizeof(esc), "\\x%02x", c);
+            shown += esc;
+        }
+    }
+    return "\"" + shown + "\"";
+}
+
+::testing::AssertionResult same_bytes(const std::string& actual, const std::string& expected) {
+    size_t n = std::min(actual.size(), expected.size());
+    size_t at = 0;
+    while (at < n && actual[at] == expected[at]) at++;
+    if (at == n && actual.size() == expected.size()) return ::testing::AssertionSuccess();
+    return ::testing::AssertionFailure()
+           << actual.size() << " bytes where " << expected.size()
+           << " were expected; first difference at offset " << at << ": got "
+           << excerpt(actual, at) << ", expected " << excerpt(expected, at);
+}
+
+bool is_prefix(const std::string& part, const std::string& whole) {
+    return part.size() <= whole.size() && whole.compare(0, part.size(), part) == 0;
+}
+
+bool is_suffix(const std::string& part, const std::string& whole) {
+    return part.size() <= whole.size() &&
+           whole.compare(whole.size() - part.size(), part.size(), part) == 0;
 }

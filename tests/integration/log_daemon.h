@@ -7,6 +7,8 @@
 #include <string>
 #include <vector>
 
+#include <gtest/gtest.h>
+
 #include "tests/integration/emu_phone.h"
 
 constexpr char kHistory[] = "/data/misc/tqlog/tqlog_history";  // the daemon's central history
@@ -25,6 +27,11 @@ int ctl(EmuPhone& phone, const std::vector<std::string>& args, std::string* out 
 bool configure(EmuPhone& phone, const std::vector<std::string>& settings);
 
 std::string history(const EmuPhone& phone);
+// The phone's platform log: one "time pid tid priority tag: message" line per record.
+std::string platform_log(const EmuPhone& phone);
+
+// For each line of text that holds needle, what follows it on that line.
+std::vector<std::string> after_each(const std::string& text, const std::string& needle);
 
 // Waits until the central history holds needle at least times times.
 bool wait_history(const EmuPhone& phone, const std::string& needle, int times = 1,
@@ -58,3 +65,12 @@ std::unique_ptr<EmuProcess> connect_listener(EmuPhone& phone, const std::string&
 // Lines "<tag> line NNNNNNN ...\n" numbered from first, each of length bytes
 // (at least 24): a stream in which a lost, doubled or torn line shows.
 std::string numbered_lines(const std::string& tag, int first, int n, int length = 64);
+
+// Byte-exact comparison that reports where the two first differ, with a short
+// excerpt of each, instead of printing megabytes.
+::testing::AssertionResult same_bytes(const std::string& actual, const std::string& expected);
+
+// True when part is the first part.size() bytes of whole.
+bool is_prefix(const std::string& part, const std::string& whole);
+// True when part is the last part.size() bytes of whole.
+bool is_suffix(const std::string& part, const std::string& whole);
