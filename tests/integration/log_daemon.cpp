@@ -60,6 +60,16 @@ std::string history_since_last(const EmuPhone& phone, const std::string& needle)
     return at == std::string::npos ? std::string() : text.substr(at + needle.size());
 }
 
+std::vector<std::string> recorded_values(const EmuPhone& phone, const std::string& record,
+                                         bool* same) {
+    // The platform log first: each record goes to the history before it.
+    std::vector<std::string> logged = after_each(platform_log(phone), "TavloLogD: " + record);
+    std::vector<std::string> values = after_each(history(phone), record);
+    *same = !logged.empty() && logged.size() <= values.size() &&
+            std::equal(logged.begin(), logged.end(), values.begin());
+    return values;
+}
+
 bool collector_pids(const EmuPhone& phone, int pids[5]) {
     std::string text = history(phone);
     // The record is the only one that starts with "M(" after the time stamp.

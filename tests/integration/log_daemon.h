@@ -33,6 +33,12 @@ std::string platform_log(const EmuPhone& phone);
 // For each line of text that holds needle, what follows it on that line.
 std::vector<std::string> after_each(const std::string& text, const std::string& needle);
 
+// The values the daemon recorded after record ("recv efd_chld ") in its
+// history, in order; *same is set when the platform log shows the same values
+// (it may lag the history by the record being written just now).
+std::vector<std::string> recorded_values(const EmuPhone& phone, const std::string& record,
+                                         bool* same);
+
 // Waits until the central history holds needle at least times times.
 bool wait_history(const EmuPhone& phone, const std::string& needle, int times = 1,
                   int timeout_ms = 10000);
