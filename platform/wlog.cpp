@@ -15,6 +15,7 @@
 #include <time.h>
 #include <unistd.h>
 
+#include "common/civil_time.h"
 #include "common/io_util.h"
 
 #define WLOG_PATH "/dev/emu/wlog"
@@ -50,29 +51,14 @@ static long utc_offset() {
     return g_utc_offset.load(std::memory_order_relaxed);
 }
 
-// "MM-DD HH:MM:SS.mmm" of the local time, from days since the epoch with
-// Howard Hinnant's civil-from-days algorithm.
+// "MM-DD HH:MM:SS.mmm" of the local time.
 static void format_time(char* out, size_t n) {
     struct timespec ts;
     clock_gettime(CLOCK_REALTIME, &ts);
-    long long t = static_cast<long long>(ts.tv_sec) + utc_offset();
-    long long days = t / 86400;
-    long long secs = t % 86400;
-    if (secs < 0) {
-        secs += 86400;
-        days -= 1;
-    }
-    long long z = days + 719468;
-    long long era = (z >= 0 ? z : z - 146096) / 146097;
-    long long doe = z - era * 146097;
-    long long yoe = (doe - doe / 1460 + doe / 36524 - doe / 146096) / 365;
-    long long doy = doe - (365 * yoe + yoe / 4 - yoe / 100);
-    long long mp = (5 * doy + 2) / 153;
-    int day = static_cast<int>(doy - (153 * mp + 2) / 5 + 1);
-    int month = static_cast<int>(mp < 10 ? mp + 3 : mp - 9);
-    snprintf(out, n, "%02d-%02d %02d:%02d:%02d.%03d", month, day, static_cast<int>(secs / 3600),
-             static_cast<int>(secs / 60 % 60), static_cast<int>(secs % 60),
-             static_cast<int>(ts.tv_nsec / 1000000));
+    struct tm local;
+    civil_time(static_cast<long long>(ts.tv_sec) + utc_offset(), &local);
+    snprintf(out, n, "%02d-%02d %02d:%02d:%02d.%03d", local.tm_mon + 1, local.tm_mday,
+             local.tm_hour, local.tm_min, local.tm_sec, static_cast<int>(ts.tv_nsec / 1000000));
 }
 
 // Appends the message bytes [p, end) to line (which holds len bytes), each
