@@ -51,6 +51,7 @@ TEST(ControlCommands, StartAndStopPublishTheRunAndRepeatsChangeNothing) {
     EXPECT_EQ(1, count(history(phone), "tavlolog already stopped, ignore this stop"));
     EXPECT_EQ(1, count(history(phone), "tavlolog stop done"));
     EXPECT_EQ("0", phone.getprop("debug.TQ.running"));
+    EXPECT_EQ(1, daemon_starts(phone)) << "the daemon ended during the test";
 }
 
 struct RotationSizeCase {
@@ -71,6 +72,7 @@ TEST_P(ControlRotationSize, IsTheRunSizeSharedByItsFiles) {
     ASSERT_EQ(0, ctl(phone, {"start"}, &out));
     EXPECT_EQ(GetParam().logsize, phone.getprop("debug.TQ.logsize"));
     EXPECT_EQ("1", phone.getprop("debug.TQ.running"));
+    EXPECT_EQ(1, daemon_starts(phone)) << "the daemon ended during the test";
 }
 
 INSTANTIATE_TEST_SUITE_P(
@@ -101,6 +103,7 @@ TEST(ControlCommands, MessageWithoutTerminatorLosesItsLastByte) {
     EXPECT_EQ(0, ctl(phone, {"start"}, &out));
     EXPECT_EQ("start,1\n", out);
     EXPECT_EQ("1", phone.getprop("debug.TQ.running"));
+    EXPECT_EQ(1, daemon_starts(phone)) << "the daemon ended during the test";
 }
 
 TEST(ControlCommands, ConfigurationIsStoredAndAppliesFromTheNextStart) {
@@ -140,6 +143,7 @@ TEST(ControlCommands, ConfigurationIsStoredAndAppliesFromTheNextStart) {
     EXPECT_FALSE(contains(second, "kernel_log, fd = ")) << second;
     // Only the Bluetooth type is on now: its five files share the 300 MB.
     EXPECT_EQ("61440", phone.getprop("debug.TQ.logsize"));
+    EXPECT_EQ(1, daemon_starts(phone)) << "the daemon ended during the test";
 }
 
 // The tavlologctl client must see a closed connection, and the daemon
@@ -178,6 +182,7 @@ TEST(ControlClients, TenAreServedAndTheEleventhIsClosedAtOnce) {
         if (i == 3) continue;
         EXPECT_EQ(-1, listeners[i]->wait(0)) << "listener " << i << " ended";
     }
+    EXPECT_EQ(1, daemon_starts(phone)) << "the daemon ended during the test";
 }
 
 struct PeerCase {
@@ -217,6 +222,7 @@ TEST(ControlClients, OnlyPrivilegedUsersAreServed) {
     expect_closed_without_effect(phone, rc, out);
     EXPECT_TRUE(run_folders(phone).empty());
     EXPECT_EQ(3, count(history(phone), "recv 'logsize=300'"));
+    EXPECT_EQ(1, daemon_starts(phone)) << "the daemon ended during the test";
 }
 
 }  // namespace

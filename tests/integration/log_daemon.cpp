@@ -38,6 +38,10 @@ bool configure(EmuPhone& phone, const std::vector<std::string>& settings) {
 
 std::string history(const EmuPhone& phone) { return phone.read_file(kHistory); }
 
+int daemon_starts(const EmuPhone& phone) {
+    return count(phone.read_file("/dev/emu/init.log"), "start tavlo_log_d pid ");
+}
+
 std::string platform_log(const EmuPhone& phone) { return phone.read_file("/dev/emu/wlog"); }
 
 std::vector<std::string> after_each(const std::string& text, const std::string& needle) {

@@ -27,6 +27,10 @@ int ctl(EmuPhone& phone, const std::vector<std::string>& args, std::string* out 
 bool configure(EmuPhone& phone, const std::vector<std::string>& settings);
 
 std::string history(const EmuPhone& phone);
+
+// How often the phone's init has started the daemon: more than once means it
+// ended (crashed) and was restarted behind the test's back.
+int daemon_starts(const EmuPhone& phone);
 // The phone's platform log: one "time pid tid priority tag: message" line per record.
 std::string platform_log(const EmuPhone& phone);
 

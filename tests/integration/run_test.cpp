@@ -66,6 +66,7 @@ TEST(LogRun, KernelLogHoldsTheHeaderAndExactlyTheBytesWritten) {
         EXPECT_EQ(kFileHeader, file) << name;
     }
     EXPECT_TRUE(contains(history(phone), "no collector for bt_log"));
+    EXPECT_EQ(1, daemon_starts(phone)) << "the daemon ended during the test";
 }
 
 TEST(LogRun, RotationKeepsFiveGenerationsOfTheNewestBytes) {
@@ -111,6 +112,7 @@ TEST(LogRun, RotationKeepsFiveGenerationsOfTheNewestBytes) {
     // Read in order from the oldest generation on, they are the stream's end.
     EXPECT_TRUE(is_suffix(kept, stream)) << kept.size() << " bytes kept of " << stream.size();
     EXPECT_LT(kept.size(), stream.size());
+    EXPECT_EQ(1, daemon_starts(phone)) << "the daemon ended during the test";
 }
 
 // Feeds numbered lines into the phone's kernel log at a steady pace until
@@ -212,6 +214,7 @@ TEST(LogRun, StopInASteadyStreamLosesAndRepeatsNothing) {
     ASSERT_EQ(0, ctl(phone, {"stop"}, &out));
     std::string second_body = body_of(phone.read_file(second).substr(skip));
     EXPECT_TRUE(same_bytes(first_body + second_body, stream));
+    EXPECT_EQ(1, daemon_starts(phone)) << "the daemon ended during the test";
 }
 
 struct OruCase {
@@ -240,6 +243,7 @@ TEST_P(LogRunOru, ModeFollowsTheBuild) {
     bool switched = c.after_start[0] != '\0';
     EXPECT_EQ(switched, contains(history(phone), "init oru mode:"));
     EXPECT_EQ(switched, contains(history(phone), "deinit oru mode:"));
+    EXPECT_EQ(1, daemon_starts(phone)) << "the daemon ended during the test";
 }
 
 INSTANTIATE_TEST_SUITE_P(
@@ -294,6 +298,7 @@ TEST(LogRunEnds, WhenTheCardRunsLowEveryClientHearsStorageFull) {
     std::string out;
     EXPECT_EQ(0, ctl(phone, {"stop"}, &out));
     EXPECT_EQ("stop,1\n", out);
+    EXPECT_EQ(1, daemon_starts(phone)) << "the daemon ended during the test";
 }
 
 TEST(LogRunEnds, WhenTheRunFolderIsRemovedEveryClientHearsFolderLost) {
@@ -332,6 +337,7 @@ TEST(LogRunEnds, WhenTheRunFolderIsRemovedEveryClientHearsFolderLost) {
     EXPECT_EQ(0, ctl(phone, {"start"}, &out));
     EXPECT_EQ("start,1\n", out);
     EXPECT_TRUE(phone.file_exists(run_folder(phone) + "kernel_log"));
+    EXPECT_EQ(1, daemon_starts(phone)) << "the daemon ended during the test";
 }
 
 }  // namespace

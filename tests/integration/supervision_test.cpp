@@ -78,6 +78,7 @@ TEST_P(CollectorDeath, StopsTheRunAndTellsEveryClient) {
     ASSERT_TRUE(phone.write_kmsg("after the death\n"));
     EXPECT_TRUE(EmuPhone::wait_for(
         [&] { return contains(phone.read_file(next), "after the death\n"); }));
+    EXPECT_EQ(1, daemon_starts(phone)) << "the daemon ended during the test";
 }
 
 // Killed from outside, a collector leaves no reason: no warning is given.
