@@ -54,6 +54,27 @@ TEST(ControlCommands, StartAndStopPublishTheRunAndRepeatsChangeNothing) {
     EXPECT_EQ(1, daemon_starts(phone)) << "the daemon ended during the test";
 }
 
+TEST(ControlCommands, StartFailsWhenItsFolderCannotBeMade) {
+    EmuPhone phone;
+    ASSERT_TRUE(phone.boot());
+    // A file where the folder of all runs belongs.
+    ASSERT_EQ(0, phone.exec({"touch", "/mnt/sdcard/qrvlog"}));
+    std::string out;
+    EXPECT_EQ(1, ctl(phone, {"start"}, &out));
+    EXPECT_EQ("start,0\n", out);
+    EXPECT_EQ("0", phone.getprop("debug.TQ.running"));
+    std::string text = history(phone);
+    EXPECT_TRUE(contains(text, "fails at last")) << text;
+    EXPECT_FALSE(contains(text, " M(")) << text;
+    EXPECT_TRUE(phone.read_file("/dev/emu/oru_calls").empty());
+
+    ASSERT_EQ(0, phone.exec({"rm", "/mnt/sdcard/qrvlog"}));
+    EXPECT_EQ(0, ctl(phone, {"start"}, &out));
+    EXPECT_EQ("start,1\n", out);
+    EXPECT_EQ("1", phone.getprop("debug.TQ.running"));
+    EXPECT_EQ(1, daemon_starts(phone)) << "the daemon ended during the test";
+}
+
 struct RotationSizeCase {
     const char* name;
     std::vector<std::string> settings;
@@ -143,6 +164,53 @@ TEST(ControlCommands, ConfigurationIsStoredAndAppliesFromTheNextStart) {
     EXPECT_FALSE(contains(second, "kernel_log, fd = ")) << second;
     // Only the Bluetooth type is on now: its five files share the 300 MB.
     EXPECT_EQ("61440", phone.getprop("debug.TQ.logsize"));
+    EXPECT_EQ(1, daemon_starts(phone)) << "the daemon ended during the test";
+}
+
+TEST(ControlCommands, FastPowerOffKeepsLoggingIntoDataAndClosesEveryClient) {
+    EmuPhone phone;
+    ASSERT_TRUE(phone.boot());
+    ASSERT_TRUE(configure(phone, {"AndroidLog=0", "BTLog=0"}));
+    auto starter = connect_listener(phone, "deep_start");
+    ASSERT_TRUE(starter);
+    EXPECT_EQ("deep_start,1\n", starter->output());
+    // The configuration changes after the reply.
+    EXPECT_TRUE(EmuPhone::wait_for(
+        [&] { return contains(phone.read_file(kConfig), "autostart=1\n"); }));
+    auto bystander = connect_listener(phone);
+    ASSERT_TRUE(bystander);
+    std::string folder = run_folder(phone);
+    ASSERT_TRUE(phone.write_kmsg("before the power-off\n"));
+    ASSERT_TRUE(EmuPhone::wait_for([&] {
+        return contains(phone.read_file(folder + "kernel_log"), "before the power-off\n");
+    }));
+
+    std::string out;
+    EXPECT_EQ(0, ctl(phone, {"HBR_SHUTDOWN"}, &out));
+    EXPECT_EQ("HBR_SHUTDOWN,1\n", out);
+    // Nobody is to give commands any more: every connection is closed.
+    EXPECT_EQ(0, starter->wait(5000));
+    EXPECT_EQ(0, bystander->wait(5000));
+    EXPECT_EQ("1", phone.getprop("debug.TQ.running"));
+    EXPECT_EQ("/data/log_hbr/", run_folder(phone));
+    // 60 MB for the kernel log's five files.
+    EXPECT_EQ("12288", phone.getprop("debug.TQ.logsize"));
+
+    // The same collector goes on, into /data, where the logs survive the power-off.
+    ASSERT_TRUE(phone.write_kmsg("during the power-off\n"));
+    EXPECT_TRUE(EmuPhone::wait_for([&] {
+        return phone.read_file("/data/log_hbr/kernel_log") ==
+               std::string(kFileHeader) + "during the power-off\n";
+    }));
+    EXPECT_EQ(std::string(kFileHeader) + "before the power-off\n",
+              phone.read_file(folder + "kernel_log"));
+
+    // A power-off that was not followed through: deep_stop ends logging at boot too.
+    EXPECT_EQ(0, ctl(phone, {"deep_stop"}, &out));
+    EXPECT_EQ("deep_stop,1\n", out);
+    EXPECT_EQ("0", phone.getprop("debug.TQ.running"));
+    EXPECT_TRUE(EmuPhone::wait_for(
+        [&] { return contains(phone.read_file(kConfig), "autostart=0\n"); }));
     EXPECT_EQ(1, daemon_starts(phone)) << "the daemon ended during the test";
 }
 
