@@ -2,6 +2,8 @@
 // start and stop commands and what they publish, a message without its
 // terminating byte, configuration messages and when they take effect, the
 // ten client slots and the peers that are refused.
+#include <time.h>
+
 #include <string>
 #include <vector>
 
@@ -211,6 +213,46 @@ TEST(ControlCommands, FastPowerOffKeepsLoggingIntoDataAndClosesEveryClient) {
     EXPECT_EQ("0", phone.getprop("debug.TQ.running"));
     EXPECT_TRUE(EmuPhone::wait_for(
         [&] { return contains(phone.read_file(kConfig), "autostart=0\n"); }));
+    EXPECT_EQ(1, daemon_starts(phone)) << "the daemon ended during the test";
+}
+
+TEST(ControlCommands, CopyStartsARunThenMovesItOnceWithItsCollector) {
+    EmuPhone phone;
+    ASSERT_TRUE(phone.boot());
+    ASSERT_TRUE(configure(phone, {"AndroidLog=0", "BTLog=0"}));
+    std::string out;
+    EXPECT_EQ(0, ctl(phone, {"copy"}, &out));
+    EXPECT_EQ("copy,1\n", out);
+    time_t started = time(nullptr);
+    EXPECT_TRUE(contains(history(phone), "start tavlolog when recv copy"));
+    ASSERT_TRUE(EmuPhone::wait_for([&] { return phone.getprop("debug.TQ.running") == "1"; }));
+    std::string first = run_folder(phone);
+    ASSERT_TRUE(phone.write_kmsg("in the first folder\n"));
+    ASSERT_TRUE(EmuPhone::wait_for([&] {
+        return contains(phone.read_file(first + "kernel_log"), "in the first folder\n");
+    }));
+
+    // Folder names go by the second: the move needs a later one.
+    ASSERT_TRUE(EmuPhone::wait_for([&] { return time(nullptr) > started; }, 2000));
+    EXPECT_EQ(0, ctl(phone, {"copy"}, &out));
+    EXPECT_EQ("copy,1\n", out);
+    EXPECT_TRUE(contains(history(phone), "copy to sdcard!"));
+    std::string second = run_folder(phone);
+    EXPECT_NE(first, second);
+    ASSERT_TRUE(phone.write_kmsg("in the second folder\n"));
+    EXPECT_TRUE(EmuPhone::wait_for([&] {
+        return phone.read_file(second + "kernel_log") ==
+               std::string(kFileHeader) + "in the second folder\n";
+    }));
+    EXPECT_EQ(std::string(kFileHeader) + "in the first folder\n",
+              phone.read_file(first + "kernel_log"));
+    // The collector of the run went on: no second one was forked.
+    EXPECT_EQ(1, count(history(phone), " M("));
+
+    EXPECT_EQ(0, ctl(phone, {"copy"}, &out));
+    EXPECT_EQ("copy,1\n", out);
+    EXPECT_TRUE(contains(history(phone), "has copyed to sd,ignore this 'copy'"));
+    EXPECT_EQ(second, run_folder(phone));
     EXPECT_EQ(1, daemon_starts(phone)) << "the daemon ended during the test";
 }
 
