@@ -204,17 +204,22 @@ void check_stop(CollectorLink* collector) {
     if (stop != 0) exit_collector(collector, 0, REASON_NONE);
 }
 
+// A collector ends with _exit, never exit: it is a forked copy of the
+// multithreaded daemon, and exit would run the daemon's exit-time work in it
+// (static destructors, atexit handlers, a sanitizer's leak check), which can
+// wait for ever on a lock another daemon thread held at the fork. _exit is
+// also safe from the stop signal's handler.
 void exit_collector(CollectorLink* collector, int status, int reason) {
     // From here on a stop signal must not re-enter: the process is ending anyway.
     block_stop_signal(nullptr);
     if (collector == nullptr || collector->shm == nullptr || collector->sem == nullptr) {
         // Stopped before the block was mapped: nothing to mark.
-        exit(status);
+        _exit(status);
     }
     int slot = log_type_from_letter(collector->log_type) + 1;
     if (slot < SLOT_MAIN) {
         COLLECTOR_HLOG(collector->kind, WLOG_ERROR, "unknow log type %c", collector->log_type);
-        exit(status);
+        _exit(status);
     }
     ControlSlot& own = collector->shm->slots[slot];
     int locked = control_block_lock(collector->sem);
@@ -223,7 +228,7 @@ void exit_collector(CollectorLink* collector, int status, int reason) {
     __atomic_store_n(&own.exited, 1, __ATOMIC_SEQ_CST);
     if (locked) control_block_unlock(collector->sem);
     COLLECTOR_WLOG(collector->kind, WLOG_DEBUG, "%c has been set.", collector->log_type);
-    exit(status);
+    _exit(status);
 }
 
 void on_stop_signal(int) { exit_collector(current_collector, 0, REASON_SIGNAL); }

@@ -15,7 +15,7 @@ struct ControlBlock;
 enum CollectorKind { KIND_KERNEL = 0, KIND_ANDROID = 1, KIND_BT = 2 };
 
 // The link fields of a collector object. Built on the child's stack by its fork
-// wrapper and never destroyed: the process ends through exit.
+// wrapper and never destroyed: the process ends through _exit.
 class CollectorLink {
   public:
     CollectorLink(CollectorKind kind, char type) : kind(kind), log_type(type) {}

@@ -64,7 +64,7 @@ int fork_kernel_log(LogController* controller, int block_fd) {
         KmsgCat collector;
         collector.run(log_type_name(LOG_KERNEL), block_fd);
         WLOG(TAG_MAIN, WLOG_DEBUG, "kernel log exits");
-        exit(0);
+        _exit(0);  // see exit_collector
     }
     controller->klog_pid = pid;
     WLOG(TAG_MAIN, WLOG_DEBUG, "kmsgcat pid = %d", pid);

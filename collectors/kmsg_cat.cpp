@@ -31,7 +31,7 @@ void KmsgCat::run(const char*, int block_fd) {
         // No block (or no lock for it): nothing can be marked.
         int err = shm_fd == -1 ? EBADF : errno;
         HLOG(TAG_KERNEL, WLOG_ERROR, "shm open failed! errno = %d, %s", err, strerror(err));
-        exit(1);
+        _exit(1);  // see exit_collector
     }
 
     int kmsg_fd = RETRY_EINTR(open(kmsg_path, O_RDONLY | O_NONBLOCK | O_CLOEXEC));
