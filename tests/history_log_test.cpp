@@ -1,160 +1,88 @@
-// The history log on the emulated phone's real paths: which files a level
-// reaches, the line format byte for byte, re-creation of the folder, and the
-// two hazards of a multi-threaded, forking daemon (re-entry, inherited lock).
+// The history log on the phone's real paths, and the hazards of a multi-threaded, forking daemon.
 #include "storage/history_log.h"
 
-#include <errno.h>
-#include <fcntl.h>
-#include <gtest/gtest.h>
-#include <pthread.h>
-#include <signal.h>
-#include <stdio.h>
-#include <stdlib.h>
-#include <string.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
-#include <time.h>
-#include <unistd.h>
-
 #include <atomic>
-#include <chrono>
 #include <future>
 #include <memory>
-#include <string>
 #include <thread>
-#include <vector>
 
-#include "common/limits.h"
-#include "platform/properties.h"
+#include "test_util.h"
 
 namespace {
 
-const char kCentral[] = "/data/misc/tqlog/tqlog_history";
 const char kRunFolder[] = "/data/run/APLog_2026_0304_070649/";
 const char kRunFile[] = "/data/run/APLog_2026_0304_070649/tqlog_history";
 const char kPlatformLog[] = "/dev/emu/wlog";
-
-std::string read_file(const char* path) {
-    std::string out;
-    int fd = open(path, O_RDONLY | O_CLOEXEC);
-    if (fd < 0) return out;
-    char buf[4096];
-    ssize_t n;
-    while ((n = read(fd, buf, sizeof(buf))) > 0) out.append(buf, static_cast<size_t>(n));
-    close(fd);
-    return out;
-}
-
-std::vector<std::string> lines_of(const char* path) {
-    std::vector<std::string> out;
-    std::string all = read_file(path);
-    size_t start = 0;
-    while (start < all.size()) {
-        size_t end = all.find('\n', start);
-        if (end == std::string::npos) end = all.size();
-        out.push_back(all.substr(start, end - start));
-        start = end + 1;
-    }
-    return out;
-}
 
 // "YYYY:MM:DD HH:MM:SS " at the start of line.
 bool has_stamp(const std::string& line) {
     static const char shape[] = "dddd:dd:dd dd:dd:dd ";
     if (line.size() < 20) return false;
-    for (size_t i = 0; i < 20; i++) {
-        bool ok = shape[i] == 'd' ? (line[i] >= '0' && line[i] <= '9') : line[i] == shape[i];
-        if (!ok) return false;
-    }
+    for (size_t i = 0; i < 20; i++)
+        if (shape[i] == 'd' ? !isdigit(static_cast<unsigned char>(line[i])) : line[i] != shape[i]) return false;
     return true;
 }
 
-// The message of a history line, after checking its timestamp.
-std::string message_of(const std::string& line) {
-    EXPECT_TRUE(has_stamp(line)) << line;
-    return line.size() >= 20 ? line.substr(20) : "";
+// The messages of a history file, after checking each line's timestamp.
+std::vector<std::string> messages_of(const char* path) {
+    std::vector<std::string> out;
+    for (const std::string& line : lines_of(path)) {
+        EXPECT_TRUE(has_stamp(line)) << line;
+        out.push_back(line.size() >= 20 ? line.substr(20) : "");
+    }
+    return out;
 }
 
-mode_t mode_of(const char* path) {
-    struct stat st;
-    return stat(path, &st) == 0 ? (st.st_mode & 07777) : 0;
-}
+using Messages = std::vector<std::string>;
 
 class HistoryLogTest : public ::testing::Test {
   protected:
     void SetUp() override {
-        if (access("/dev/emu/properties", F_OK) != 0) GTEST_SKIP() << "runs only inside the emulated phone";
-        // As the daemon: modes are exactly those given at creation.
-        umask(0);
-        ASSERT_EQ(system("rm -rf /data/* /dev/emu/properties/* && : > /dev/emu/wlog"), 0);
-        ASSERT_EQ(system("mkdir -p /data/misc/tqlog /data/run/APLog_2026_0304_070649"), 0);
+        SKIP_OUTSIDE_PHONE();
+        umask(0);  // as the daemon: modes are exactly those given at creation
+        ASSERT_EQ(system("rm -rf /data/* /dev/emu/properties/* && : > /dev/emu/wlog && "
+                         "mkdir -p /data/misc/tqlog /data/run/APLog_2026_0304_070649"),
+                  0);
     }
-
     void set_run_folder(const char* folder) { ASSERT_EQ(property_set("debug.TQ.realpath", folder), 0); }
 };
 
-struct LevelCase {
-    const char* name;
-    int level;
-    bool run_folder_set;
-    bool in_run_file;
-    bool in_central;
-};
-
-void PrintTo(const LevelCase& c, std::ostream* os) { *os << c.name; }
-
-class HistoryLevelTest : public HistoryLogTest, public ::testing::WithParamInterface<LevelCase> {};
-
-TEST_P(HistoryLevelTest, LevelChoosesTheFiles) {
-    const LevelCase& c = GetParam();
-    if (c.run_folder_set) set_run_folder(kRunFolder);
-    history_log(c.level, "record at level %d", c.level);
-    std::string expected = "record at level " + std::to_string(c.level);
-    std::vector<std::string> run = lines_of(kRunFile);
-    std::vector<std::string> central = lines_of(kCentral);
-    ASSERT_EQ(run.size(), c.in_run_file ? 1u : 0u);
-    ASSERT_EQ(central.size(), c.in_central ? 1u : 0u);
-    if (c.in_run_file) {
-        EXPECT_EQ(message_of(run[0]), expected);
+TEST_F(HistoryLogTest, LevelChoosesTheFiles) {
+    const struct {
+        int level;
+        const char* run_folder;  // "": no run
+        bool in_run_file, in_central;
+    } cases[] = {
+        {0, kRunFolder, false, true}, {0, "", false, true},  {1, kRunFolder, true, false},
+        {1, "", false, true},         {2, kRunFolder, true, true}, {2, "", false, true},
+        {3, kRunFolder, false, false}, {-1, kRunFolder, false, false},
+        {1, "/data/run/gone/", false, false},  // a vanished run folder is not recreated
+        {2, "/data/run/gone/", false, true},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(std::to_string(c.level) + " " + c.run_folder);
+        unlink(kRunFile);
+        unlink(kHistory);
+        set_run_folder(c.run_folder);
+        history_log(c.level, "record at level %d", c.level);
+        Messages expected = {"record at level " + std::to_string(c.level)};
+        EXPECT_EQ(messages_of(kRunFile), c.in_run_file ? expected : Messages());
+        EXPECT_EQ(messages_of(kHistory), c.in_central ? expected : Messages());
+        if (c.in_run_file && c.in_central) {
+            EXPECT_EQ(read_file(kRunFile), read_file(kHistory));
+        }
     }
-    if (c.in_central) {
-        EXPECT_EQ(message_of(central[0]), expected);
-    }
-    if (c.in_run_file && c.in_central) {
-        EXPECT_EQ(run[0], central[0]);
-    }
-}
-
-INSTANTIATE_TEST_SUITE_P(
-    Levels, HistoryLevelTest,
-    ::testing::Values(LevelCase{"ZeroDuringRun", 0, true, false, true},
-                      LevelCase{"ZeroWithoutRun", 0, false, false, true},
-                      LevelCase{"OneDuringRun", 1, true, true, false},
-                      LevelCase{"OneWithoutRun", 1, false, false, true},
-                      LevelCase{"TwoDuringRun", 2, true, true, true},
-                      LevelCase{"TwoWithoutRun", 2, false, false, true},
-                      LevelCase{"Three", 3, true, false, false},
-                      LevelCase{"Negative", -1, true, false, false}),
-    [](const ::testing::TestParamInfo<LevelCase>& info) { return info.param.name; });
-
-TEST_F(HistoryLogTest, LevelOneWithAVanishedRunFolderIsLost) {
-    set_run_folder("/data/run/gone/");
-    history_log(1, "lost");
-    EXPECT_EQ(read_file(kCentral), "");
-    EXPECT_NE(access("/data/run/gone", F_OK), 0);
-    history_log(2, "kept");
-    ASSERT_EQ(lines_of(kCentral).size(), 1u);
-    EXPECT_EQ(message_of(lines_of(kCentral)[0]), "kept");
+    EXPECT_FALSE(exists("/data/run/gone"));
 }
 
 TEST_F(HistoryLogTest, LineIsTimestampMessageAndNewline) {
     time_t before = time(nullptr);
     history_log(0, "start %s", "tavlolog");
     time_t after = time(nullptr);
-    std::string all = read_file(kCentral);
+    std::string all = read_file(kHistory);
     ASSERT_EQ(all.size(), 20u + 14u + 1u);
     EXPECT_EQ(all.substr(20), "start tavlolog\n");
-    // The timestamp is the local time of the call, colons in the date too.
+    // The local time of the call, colons in the date too.
     bool matched = false;
     for (time_t t = before; t <= after && !matched; t++) {
         struct tm tm;
@@ -164,52 +92,44 @@ TEST_F(HistoryLogTest, LineIsTimestampMessageAndNewline) {
         matched = all.compare(0, 20, stamp) == 0;
     }
     EXPECT_TRUE(matched) << all;
-}
 
-TEST_F(HistoryLogTest, LongMessageIsCutAt254Characters) {
+    unlink(kHistory);  // an empty message still gets its timestamp
+    history_log(0, "%s", "");
+    all = read_file(kHistory);
+    ASSERT_EQ(all.size(), 21u);
+    EXPECT_TRUE(has_stamp(all));
+    EXPECT_EQ(all[20], '\n');
+
+    unlink(kHistory);  // 300 characters: 234 of them fit a line of 254
     std::string long_message(300, 'm');
     history_log(0, "%s", long_message.c_str());
-    std::string all = read_file(kCentral);
+    all = read_file(kHistory);
     ASSERT_EQ(all.size(), 255u);
-    EXPECT_EQ(all.back(), '\n');
-    EXPECT_EQ(all.substr(20, 234), long_message.substr(0, 234));
-}
-
-TEST_F(HistoryLogTest, EmptyMessageStillWritesTheTimestamp) {
-    const char* empty = "";
-    history_log(0, "%s", empty);
-    std::string all = read_file(kCentral);
-    ASSERT_EQ(all.size(), 21u);
-    EXPECT_EQ(all[19], ' ');
-    EXPECT_EQ(all[20], '\n');
+    EXPECT_EQ(all.substr(20), long_message.substr(0, 234) + "\n");
 }
 
 TEST_F(HistoryLogTest, ControlBytesCannotForgeLines) {
     history_log(0, "recv '%s' from client %d", "stop\n2026:01:01 00:00:00 forged\r\x1b", 3);
-    std::vector<std::string> lines = lines_of(kCentral);
-    ASSERT_EQ(lines.size(), 1u);
-    EXPECT_EQ(message_of(lines[0]), "recv 'stop?2026:01:01 00:00:00 forged?\?' from client 3");
+    EXPECT_EQ(messages_of(kHistory), Messages{"recv 'stop?2026:01:01 00:00:00 forged?\?' from client 3"});
 }
 
 TEST_F(HistoryLogTest, DeletedFolderIsRecreatedWithItsModes) {
     history_log(0, "first");
-    EXPECT_EQ(mode_of(kCentral), 0664u);
+    EXPECT_EQ(mode_of(kHistory), 0664u);
     ASSERT_EQ(system("rm -rf /data/misc"), 0);
     history_log(0, "second");
     EXPECT_EQ(mode_of("/data/misc"), 0775u);
     EXPECT_EQ(mode_of("/data/misc/tqlog"), 0775u);
-    EXPECT_EQ(mode_of(kCentral), 0664u);
-    ASSERT_EQ(lines_of(kCentral).size(), 1u);
-    EXPECT_EQ(message_of(lines_of(kCentral)[0]), "second");
-    // The mode is set once per folder, not on every record.
-    chmod(kCentral, 0600);
+    EXPECT_EQ(mode_of(kHistory), 0664u);
+    EXPECT_EQ(messages_of(kHistory), Messages{"second"});
+    chmod(kHistory, 0600);  // the mode is set once per folder, not on every record
     history_log(0, "third");
-    EXPECT_EQ(mode_of(kCentral), 0600u);
+    EXPECT_EQ(mode_of(kHistory), 0600u);
 }
 
+// /data/misc as a plain file: make_dir_recursive fails, and records that,
+// while the history lock is held.
 TEST_F(HistoryLogTest, UncreatableFolderDropsTheRecordWithoutDeadlock) {
-    // /data/misc as a plain file: the folder cannot be made, and the failure
-    // of make_dir_recursive happens while the history lock is held.
     ASSERT_EQ(system("rm -rf /data/misc && touch /data/misc"), 0);
     set_run_folder(kRunFolder);
     // Detached: a deadlocked writer must fail the test, not hang it.
@@ -220,69 +140,40 @@ TEST_F(HistoryLogTest, UncreatableFolderDropsTheRecordWithoutDeadlock) {
         finished->set_value();
     }).detach();
     ASSERT_EQ(done.wait_for(std::chrono::seconds(10)), std::future_status::ready) << "history_log deadlocked";
-    std::vector<std::string> run = lines_of(kRunFile);
-    ASSERT_EQ(run.size(), 1u);
-    EXPECT_EQ(message_of(run[0]), "under a broken folder");
+    EXPECT_EQ(messages_of(kRunFile), Messages{"under a broken folder"});
     std::string platform = read_file(kPlatformLog);
     EXPECT_NE(platform.find("TavloLogD/Util: mkdir fail(Not a directory)"), std::string::npos) << platform;
-    EXPECT_NE(platform.find("TavloLogD/mlog: create dir /data/misc/tqlog failed(Not a directory)"),
-              std::string::npos)
-        << platform;
+    EXPECT_NE(platform.find("TavloLogD/mlog: create dir /data/misc/tqlog failed(Not a directory)"), std::string::npos);
 }
 
-TEST_F(HistoryLogTest, RunFolderComesFromTheProperty) {
-    char out[PATH_LEN];
-    memset(out, 'x', sizeof(out));
-    EXPECT_EQ(get_run_folder(out), nullptr);
-    EXPECT_EQ(out[0], 'x') << "out must stay untouched";
-    set_run_folder(kRunFolder);
-    EXPECT_EQ(get_run_folder(out), out);
-    EXPECT_STREQ(out, kRunFolder);
-}
-
-TEST_F(HistoryLogTest, MakeDirRecursiveCreatesMissingParentsOutermostLoggedFirst) {
+TEST_F(HistoryLogTest, MakeDirRecursive) {
+    // Missing parents are made; "create dir" is logged for the full path first.
     EXPECT_EQ(make_dir_recursive("/data/a/b/c"), 1);
-    EXPECT_EQ(mode_of("/data/a"), 0775u);
-    EXPECT_EQ(mode_of("/data/a/b"), 0775u);
-    EXPECT_EQ(mode_of("/data/a/b/c"), 0775u);
-    std::string platform = read_file(kPlatformLog);
-    size_t full = platform.find("create dir /data/a/b/c\n");
-    size_t parent = platform.find("create dir /data/a/b\n");
-    size_t grandparent = platform.find("create dir /data/a\n");
-    ASSERT_NE(full, std::string::npos) << platform;
-    ASSERT_NE(parent, std::string::npos) << platform;
-    ASSERT_NE(grandparent, std::string::npos) << platform;
-    EXPECT_LT(full, parent);
-    EXPECT_LT(parent, grandparent);
-    EXPECT_EQ(read_file(kCentral), "");
-}
+    for (const char* dir : {"/data/a", "/data/a/b", "/data/a/b/c"}) EXPECT_EQ(mode_of(dir), 0775u) << dir;
+    Messages created;
+    for (const std::string& line : lines_of(kPlatformLog))
+        if (line.find("create dir ") != std::string::npos) created.push_back(line.substr(line.find("create dir ")));
+    EXPECT_EQ(created, (Messages{"create dir /data/a/b/c", "create dir /data/a/b", "create dir /data/a"}));
+    EXPECT_EQ(read_file(kHistory), "");
 
-TEST_F(HistoryLogTest, MakeDirRecursiveOnAnExistingPathFails) {
-    EXPECT_EQ(make_dir_recursive("/data/run"), 0);
-    std::vector<std::string> lines = lines_of(kCentral);
-    ASSERT_EQ(lines.size(), 1u);
-    EXPECT_EQ(message_of(lines[0]), "mkdir fail(File exists)");
+    EXPECT_EQ(make_dir_recursive("/data/run"), 0);  // an existing path is a failure
+    EXPECT_EQ(messages_of(kHistory), Messages{"mkdir fail(File exists)"});
     EXPECT_NE(read_file(kPlatformLog).find("TavloLogD/Util: mkdir fail(File exists)"), std::string::npos);
-}
 
-TEST_F(HistoryLogTest, MakeDirRecursiveRefusesAPathItWouldHaveToCut) {
-    std::string path = "/data/" + std::string(300, 'p');
-    EXPECT_EQ(make_dir_recursive(path.c_str()), 0);
+    unlink(kHistory);  // refused rather than cut
+    EXPECT_EQ(make_dir_recursive(("/data/" + std::string(300, 'p')).c_str()), 0);
     EXPECT_EQ(errno, ENAMETOOLONG);
-    ASSERT_EQ(lines_of(kCentral).size(), 1u);
-    EXPECT_EQ(message_of(lines_of(kCentral)[0]), "mkdir fail(File name too long)");
+    EXPECT_EQ(messages_of(kHistory), Messages{"mkdir fail(File name too long)"});
 }
 
-// A writer of the run file blocks in open() on a FIFO while it holds the
-// history lock; the test waits until the thread sits in that open.
+// True when thread tid sits in open() (openat is 257 on x86-64, open 2).
 bool thread_blocked_in_open(pid_t tid) {
-    char path[64];
-    snprintf(path, sizeof(path), "/proc/self/task/%d/syscall", static_cast<int>(tid));
-    std::string s = read_file(path);
-    // openat is 257 on x86-64, open is 2.
+    std::string s = read_file("/proc/self/task/" + std::to_string(tid) + "/syscall");
     return s.rfind("257 ", 0) == 0 || s.rfind("2 ", 0) == 0;
 }
 
+// A writer of the run file blocks in open() on a FIFO while it holds the
+// history lock; a child forked meanwhile must still be able to record.
 TEST_F(HistoryLogTest, ForkedChildDoesNotInheritAHeldLock) {
     ASSERT_EQ(mkfifo(kRunFile, 0666), 0);
     set_run_folder(kRunFolder);
@@ -291,8 +182,8 @@ TEST_F(HistoryLogTest, ForkedChildDoesNotInheritAHeldLock) {
         writer_tid = gettid();
         history_log(2, "parent record");
     });
-    for (int i = 0; i < 5000 && !(writer_tid != 0 && thread_blocked_in_open(writer_tid)); i++) usleep(1000);
-    ASSERT_TRUE(thread_blocked_in_open(writer_tid)) << "writer never reached the FIFO";
+    ASSERT_TRUE(wait_for([&] { return writer_tid != 0 && thread_blocked_in_open(writer_tid); }, 5000))
+        << "writer never reached the FIFO";
 
     pid_t child = fork();
     if (child == 0) {
@@ -300,37 +191,16 @@ TEST_F(HistoryLogTest, ForkedChildDoesNotInheritAHeldLock) {
         _exit(0);
     }
     ASSERT_GT(child, 0);
-    int status = -1;
-    pid_t waited = 0;
-    for (int i = 0; i < 10000 && waited == 0; i++) {
-        waited = waitpid(child, &status, WNOHANG);
-        if (waited == 0) usleep(1000);
-    }
-    if (waited == 0) {
-        kill(child, SIGKILL);
-        waitpid(child, &status, 0);
-    }
-    // Release the parent's writer.
-    int fifo = open(kRunFile, O_RDONLY | O_CLOEXEC);
-    std::string from_fifo;
-    char buf[512];
-    ssize_t n;
-    while ((n = read(fifo, buf, sizeof(buf))) > 0) from_fifo.append(buf, static_cast<size_t>(n));
-    close(fifo);
+    bool child_done = exits_with(child, 0, 10000);
+    std::string from_fifo = read_file(kRunFile);  // releases the parent's writer
     writer.join();
-
-    ASSERT_NE(waited, 0) << "child deadlocked on the inherited history lock";
-    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+    EXPECT_TRUE(child_done) << "child deadlocked on the inherited history lock";
     EXPECT_NE(from_fifo.find("parent record\n"), std::string::npos);
-    std::vector<std::string> central = lines_of(kCentral);
-    ASSERT_EQ(central.size(), 2u);
-    EXPECT_EQ(message_of(central[0]), "child record");
-    EXPECT_EQ(message_of(central[1]), "parent record");
+    EXPECT_EQ(messages_of(kHistory), (Messages{"child record", "parent record"}));
 }
 
 TEST_F(HistoryLogTest, ForkedChildStampsLocalTimeWithoutTheCLibrary) {
-    // An offset with minutes makes a wrong conversion show.
-    setenv("TZ", "XST-5:30", 1);
+    setenv("TZ", "XST-5:30", 1);  // an offset with minutes makes a wrong conversion show
     tzset();
     history_log(0, "parent before");
     pid_t child = fork();
@@ -339,12 +209,11 @@ TEST_F(HistoryLogTest, ForkedChildStampsLocalTimeWithoutTheCLibrary) {
         history_log(0, "child");
         _exit(0);
     }
-    int status;
-    ASSERT_EQ(waitpid(child, &status, 0), child);
+    EXPECT_TRUE(exits_with(child, 0));
     history_log(0, "parent after");
-    std::vector<std::string> lines = lines_of(kCentral);
+    EXPECT_EQ(messages_of(kHistory), (Messages{"parent before", "child", "parent after"}));
+    std::vector<std::string> lines = lines_of(kHistory);
     ASSERT_EQ(lines.size(), 3u);
-    EXPECT_EQ(message_of(lines[1]), "child");
     EXPECT_LE(lines[0].substr(0, 19), lines[1].substr(0, 19));
     EXPECT_LE(lines[1].substr(0, 19), lines[2].substr(0, 19));
     unsetenv("TZ");
@@ -353,8 +222,7 @@ TEST_F(HistoryLogTest, ForkedChildStampsLocalTimeWithoutTheCLibrary) {
 
 TEST_F(HistoryLogTest, RecordsOfManyProcessesNeverInterleave) {
     set_run_folder(kRunFolder);
-    constexpr int kChildren = 4;
-    constexpr int kRecords = 200;
+    constexpr int kChildren = 4, kRecords = 200;
     std::vector<pid_t> children;
     for (int c = 0; c < kChildren; c++) {
         pid_t pid = fork();
@@ -366,27 +234,19 @@ TEST_F(HistoryLogTest, RecordsOfManyProcessesNeverInterleave) {
         ASSERT_GT(pid, 0);
         children.push_back(pid);
     }
-    for (pid_t pid : children) {
-        int status;
-        ASSERT_EQ(waitpid(pid, &status, 0), pid);
-        ASSERT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
-    }
-    for (const char* path : {kCentral, kRunFile}) {
+    for (pid_t pid : children) ASSERT_TRUE(exits_with(pid, 0, 30000));
+    for (const char* path : {kHistory, kRunFile}) {
         std::vector<std::string> lines = lines_of(path);
         ASSERT_EQ(lines.size(), static_cast<size_t>(kChildren * kRecords)) << path;
         std::vector<int> next(kChildren, 0);
         for (const std::string& line : lines) {
             // A whole record: stamp, "<child> <index> " and 200 of the child's letter.
             ASSERT_TRUE(has_stamp(line)) << path << ": " << line;
-            int c = -1;
-            int i = -1;
-            int consumed = 0;
+            int c = -1, i = -1, consumed = 0;
             ASSERT_EQ(sscanf(line.c_str() + 20, "%d %d %n", &c, &i, &consumed), 2) << line;
             ASSERT_TRUE(c >= 0 && c < kChildren) << line;
-            EXPECT_EQ(line.substr(20 + static_cast<size_t>(consumed)), std::string(200, static_cast<char>('a' + c)))
-                << path << ": " << line;
-            // Each process's records stay in their own order.
-            EXPECT_EQ(i, next[c]++);
+            EXPECT_EQ(line.substr(20 + static_cast<size_t>(consumed)), std::string(200, static_cast<char>('a' + c)));
+            EXPECT_EQ(i, next[c]++) << "each process's records stay in their order";
         }
     }
 }
