@@ -106,9 +106,17 @@ TEST_F(TransistTest, EveryByteSentBeforeTheStopIsInTheFile) {
     std::string data;
     for (int i = 0; i < 1 << 20; i++) data += static_cast<char>((i * 7 + i / 251) & 0xff);
     stream_log('K', data);
-    int64_t ms = stop();  // no pause: the stop itself must collect what is still in the socket
+    // The reader cannot queue a chunk now, so these bytes are still in the
+    // socket when the stop begins: the stop itself must collect them.
+    pthread_mutex_lock(&queue_lock);
+    std::string tail = numbered_lines('M', 32768);
+    stream_log('M', tail);
+    stop_requested = true;
+    pthread_mutex_unlock(&queue_lock);
+    int64_t ms = stop();
     EXPECT_TRUE(log("kernel_log") == kHeader + data);
-    EXPECT_EQ(log("main_log"), kHeader);
+    EXPECT_TRUE(log("main_log") == kHeader + tail);
+    EXPECT_EQ(log("bt_log"), kHeader);
     EXPECT_EQ(read_exit_, 1);
     EXPECT_EQ(write_exit_, 2);
     EXPECT_LT(ms, 500);
