@@ -110,23 +110,6 @@ TEST_F(ConfigStoreTest, ReaderAcceptsWhatTheWriterNeverProduces) {
     EXPECT_TRUE(has_record("update item bogus=7 to cache failed"));
 }
 
-TEST(Trim, CutsTrailingSpacesAndLineFeedsOnly) {
-    const struct {
-        const char* in;
-        const char* out;
-    } cases[] = {{"", ""},     {"a", "a"},       {"\n", "\n"},  {"   ", ""},           {" \n", ""},
-                 {"\n\n\n", "\n"}, {"  a b  \n \n", "a b"}, {"\tx\t", "\tx\t"}, {"x\r\n", "x\r"}};
-    for (const auto& c : cases) {
-        std::string s = c.in;
-        std::vector<char> buf(s.begin(), s.end());
-        buf.push_back('\0');
-        char* r = trim(buf.data());
-        ASSERT_GE(r, buf.data());
-        ASSERT_LE(r, buf.data() + s.size());
-        EXPECT_STREQ(r, c.out) << ::testing::PrintToString(s);
-    }
-}
-
 TEST_F(ConfigStoreTest, ChangeRewritesTheFileOnlyForARealChange) {
     write_file(CONFIG_FILE, kDefaultFile);
     ino_t before = inode_of(CONFIG_FILE);

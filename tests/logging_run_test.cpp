@@ -159,11 +159,7 @@ TEST_F(RunTest, StopKeepsEverythingTheCollectorSent) {
     EXPECT_TRUE(history_has("M(0),R(0),E(0),K(" + std::to_string(controller_.klog_pid) + "),B(0)"));
 
     std::string sent;
-    for (int i = 0; i < 400; i++) {
-        char line[128];
-        snprintf(line, sizeof(line), "<6>[%5d.000000] line %d of the kernel log, some padding here\n", i, i);
-        sent += line;
-    }
+    for (int i = 0; i < 400; i++) sent += "<6>[" + std::to_string(i) + ".000000] a line of the kernel log, some padding\n";
     feed(sent);
     ASSERT_TRUE(wait_source_drained());
 
