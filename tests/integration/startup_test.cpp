@@ -10,27 +10,15 @@
 
 #include <gtest/gtest.h>
 
-#include "tests/integration/emu_phone.h"
+#include "tests/integration/log_daemon.h"
 
 namespace {
 
-const char kHistory[] = "/data/misc/tqlog/tqlog_history";
-const char kConfig[] = "/data/misc/tqlog/tqlog_config";
 const char kDefaults[] = "/system/etc/qrvlog-config.prop";
 
 const char kDefaultConfig[] =
     "autostart=0\nlogpath=internal_sd\nlogsize=300\nAndroidLog=1\nKernelLog=1\nBTLog=1\n"
     "totallogsize=600\n";
-
-bool contains(const std::string& text, const std::string& needle) {
-    return text.find(needle) != std::string::npos;
-}
-
-int count(const std::string& text, const std::string& needle) {
-    int n = 0;
-    for (size_t at = text.find(needle); at != std::string::npos; at = text.find(needle, at + 1)) n++;
-    return n;
-}
 
 // Seeds a file of the daemon's own folder before the first boot, owned as the
 // daemon would have created it.
