@@ -37,6 +37,20 @@ unsigned long long free_bytes(const std::string& host_path) {
     return static_cast<unsigned long long>(st.f_bavail) * static_cast<unsigned long long>(st.f_bsize);
 }
 
+// Every "recv efd_thread" the daemon recorded is a nonzero multiple of the
+// writer's notice (it may signal again while the run stops), and the platform
+// log shows the same sums as the history.
+void expect_writer_notices(const EmuPhone& phone, int notice) {
+    bool same = false;
+    std::vector<std::string> sums = recorded_values(phone, "recv efd_thread ", &same);
+    EXPECT_TRUE(same) << platform_log(phone);
+    EXPECT_FALSE(sums.empty()) << history(phone);
+    for (const std::string& sum : sums) {
+        EXPECT_NE("0", sum);
+        EXPECT_EQ(0, atoi(sum.c_str()) % notice) << sum;
+    }
+}
+
 TEST(LogRun, KernelLogHoldsTheHeaderAndExactlyTheBytesWritten) {
     EmuPhone phone;
     ASSERT_TRUE(phone.boot());
@@ -282,16 +296,7 @@ TEST(LogRunEnds, WhenTheCardRunsLowEveryClientHearsStorageFull) {
     std::string text = history(phone);
     EXPECT_TRUE(contains(text, "/mnt/sdcard is almost full or unavailable!!")) << text;
     EXPECT_TRUE(contains(text, "no space to write log")) << text;
-    // The writer adds 1001 each time it finds the card low (again, maybe,
-    // while the run stops); the platform log shows the same sums as the history.
-    bool same = false;
-    std::vector<std::string> sums = recorded_values(phone, "recv efd_thread ", &same);
-    EXPECT_TRUE(same) << platform_log(phone);
-    ASSERT_FALSE(sums.empty()) << text;
-    for (const std::string& sum : sums) {
-        EXPECT_NE("0", sum);
-        EXPECT_EQ(0, atoi(sum.c_str()) % 1001) << sum;
-    }
+    expect_writer_notices(phone, 1001);
     EXPECT_TRUE(is_prefix(body_of(phone.read_file(folder + "kernel_log")), stream));
     // The daemon still serves its clients.
     EXPECT_EQ(-1, starter->wait(0));
@@ -322,14 +327,7 @@ TEST(LogRunEnds, WhenTheRunFolderIsRemovedEveryClientHearsFolderLost) {
     EXPECT_EQ("0", phone.getprop("debug.TQ.running"));
     std::string text = history(phone);
     EXPECT_TRUE(contains(text, "log files " + folder + "kernel_log not exist:2")) << text;
-    bool same = false;
-    std::vector<std::string> sums = recorded_values(phone, "recv efd_thread ", &same);
-    EXPECT_TRUE(same) << platform_log(phone);
-    ASSERT_FALSE(sums.empty()) << text;
-    for (const std::string& sum : sums) {
-        EXPECT_NE("0", sum);
-        EXPECT_EQ(0, atoi(sum.c_str()) % 1002) << sum;
-    }
+    expect_writer_notices(phone, 1002);
     EXPECT_FALSE(phone.file_exists(folder));
 
     // The next start makes its folder again.
