@@ -84,20 +84,14 @@ int install_stop_signal(CollectorLink* collector) {
 }
 
 int attach_control_block(CollectorLink* collector) {
-    sem_t* sem = sem_open(CONTROL_SEM_NAME, O_CREAT, 0644, 1);
-    if (sem == SEM_FAILED) return 0;
     void* map = mmap(nullptr, CONTROL_BLOCK_SIZE, PROT_READ | PROT_WRITE, MAP_SHARED,
                      collector->shm_fd, 0);
-    if (map == MAP_FAILED) {
-        int saved = errno;
-        sem_close(sem);
-        errno = saved;
-        return 0;
-    }
+    if (map == MAP_FAILED) return 0;
+    ControlBlock* block = static_cast<ControlBlock*>(map);
     // The stop handler may read these at any moment: set the semaphore first,
     // the block last, so it never sees a block without its lock.
-    collector->sem = sem;
-    collector->shm = static_cast<ControlBlock*>(map);
+    collector->sem = control_sem(block);
+    collector->shm = block;
     return 1;
 }
 

@@ -24,7 +24,7 @@ class CollectorLink {
     const CollectorKind kind;
     ControlBlock* shm = nullptr;  // mapped block, null until mapped
     int shm_fd = -1;              // the region's descriptor, handed over by the controller
-    sem_t* sem = nullptr;         // null until opened
+    sem_t* sem = nullptr;         // the block's semaphore, null until mapped
     const char log_type;          // stream letter: "M", "R", "E", "K" or "B"
     int transist_fd = -1;         // connection to "log_socket"
 };
@@ -43,8 +43,8 @@ extern unsigned int connect_retry_us;
 // or -1 (errno set) when the handler cannot be installed.
 int install_stop_signal(CollectorLink* collector);
 
-// Opens the semaphore and maps the block of collector->shm_fd. Returns 1, or 0
-// (errno set) when either fails; then neither is kept.
+// Maps the block of collector->shm_fd, with its semaphore. Returns 1, or 0
+// (errno set) when it cannot be mapped.
 int attach_control_block(CollectorLink* collector);
 
 // Connects to "log_socket" served by the daemon and sends log_type first.

@@ -2,13 +2,16 @@
 // stop and how each collector records that it ended and why.
 #pragma once
 
+#include <semaphore.h>
 #include <stddef.h>
 #include <stdint.h>
+#include <string.h>
 
 constexpr int CONTROL_SLOT_COUNT = 6;
 constexpr int CONTROL_SLOT_SIZE = 264;
 constexpr int CONTROL_BLOCK_SIZE = CONTROL_SLOT_COUNT * CONTROL_SLOT_SIZE;  // 1584
 #define CONTROL_BLOCK_NAME "tavlolog"
+// The semaphore's name in records.
 #define CONTROL_SEM_NAME "tavlolog"
 
 // Slot 0 uses the first word as `stop`; slots 1..5 use `exited` and `reason`.
@@ -46,3 +49,24 @@ enum {
 };
 
 inline int32_t& control_stop(ControlBlock* block) { return block->slots[SLOT_RUN].exited; }
+
+// The semaphore that guards the words above lives in the block itself, in the
+// unused bytes of slot 0: unnamed and process-shared, it needs no named
+// semaphores (which Android's C library lacks), every process that maps the
+// block has it, and it goes with the run's region.
+constexpr size_t CONTROL_SEM_OFFSET = 8;
+static_assert(CONTROL_SEM_OFFSET >= offsetof(ControlSlot, unused), "clear of the stop word");
+static_assert(CONTROL_SEM_OFFSET + sizeof(sem_t) <= CONTROL_SLOT_SIZE, "inside slot 0");
+static_assert(CONTROL_SEM_OFFSET % alignof(sem_t) == 0, "aligned (the mapping is page-aligned)");
+
+inline sem_t* control_sem(ControlBlock* block) {
+    return reinterpret_cast<sem_t*>(reinterpret_cast<unsigned char*>(block) + CONTROL_SEM_OFFSET);
+}
+
+// Makes block a fresh run's block: every word clear, no reasons, the semaphore
+// free. Returns 0, or -1 (errno set) when the semaphore cannot be made.
+inline int control_block_init(ControlBlock* block) {
+    memset(block, 0, sizeof(*block));
+    for (int slot = SLOT_MAIN; slot <= SLOT_BT; slot++) block->slots[slot].reason = REASON_NONE;
+    return sem_init(control_sem(block), 1, 1);
+}

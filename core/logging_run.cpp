@@ -5,7 +5,6 @@
 #include <fcntl.h>
 #include <limits.h>
 #include <pthread.h>
-#include <semaphore.h>
 #include <signal.h>
 #include <stdint.h>
 #include <stdio.h>
@@ -114,16 +113,14 @@ static void set_logsize_property(int rotate_kb) {
     property_set(PROP_LOGSIZE, value);
 }
 
-// Unmaps and closes what the previous run left of its block and semaphore.
+// Unmaps what the previous run left of its block. The semaphore inside needs no
+// removal: it goes with the region once the last collector has let go of it.
 static void release_control_block(LogController* controller) {
     if (controller->shm != nullptr) {
         munmap(controller->shm, CONTROL_BLOCK_SIZE);
         controller->shm = nullptr;
     }
-    if (controller->sem != nullptr) {
-        sem_close(controller->sem);
-        controller->sem = nullptr;
-    }
+    controller->sem = nullptr;
 }
 
 static void create_control_block(LogController* controller) {
@@ -134,26 +131,23 @@ static void create_control_block(LogController* controller) {
         HLOG(TAG_MAIN, WLOG_ERROR, "ashmem create failed!errno:%s(%d)", strerror(err), err);
         exit(1);
     }
-    // A semaphore left by a daemon that died mid-run may be held by a dead
-    // collector; each run starts with a fresh one.
-    sem_unlink(CONTROL_SEM_NAME);
-    sem_t* sem = sem_open(CONTROL_SEM_NAME, O_CREAT, 0644, 1);
-    if (sem == SEM_FAILED) {
-        int err = errno;
-        HLOG(TAG_MAIN, WLOG_ERROR, "sem_open %s failed!errno:%s(%d)", CONTROL_SEM_NAME, strerror(err),
-             err);
-        exit(1);
-    }
     void* map = mmap(nullptr, CONTROL_BLOCK_SIZE, PROT_READ | PROT_WRITE, MAP_SHARED, shm_fd, 0);
     if (map == MAP_FAILED) {
         int err = errno;
         HLOG(TAG_MAIN, WLOG_ERROR, "mmap shared memory failed!errno:%s(%d)", strerror(err), err);
         exit(1);
     }
-    controller->sem = sem;
-    controller->shm = static_cast<ControlBlock*>(map);
-    memset(controller->shm, 0, CONTROL_BLOCK_SIZE);
-    for (int slot = SLOT_MAIN; slot <= SLOT_BT; slot++) controller->shm->slots[slot].reason = REASON_NONE;
+    // Each run has a fresh region, so a collector of an earlier run that died
+    // holding the semaphore cannot hold this one.
+    ControlBlock* block = static_cast<ControlBlock*>(map);
+    if (control_block_init(block) != 0) {
+        int err = errno;
+        HLOG(TAG_MAIN, WLOG_ERROR, "sem_init %s failed!errno:%s(%d)", CONTROL_SEM_NAME, strerror(err),
+             err);
+        exit(1);
+    }
+    controller->shm = block;
+    controller->sem = control_sem(block);
     WLOG(TAG_MAIN, WLOG_DEBUG, "create shared memory ok!");
 }
 
@@ -273,7 +267,6 @@ void stop_logging(LogController* controller) {
     }
     kill_collectors(controller);
     controller->warned = 0;
-    sem_unlink(CONTROL_SEM_NAME);
     if (shm_fd > 0) close(shm_fd);
     shm_fd = -1;
     release_control_block(controller);

@@ -108,8 +108,9 @@ inline std::string property(const char* key, const char* def = "") {
 inline std::vector<std::string> files_in(const std::string& dir) {
     std::vector<std::string> out;
     DIR* d = opendir(dir.c_str());
-    while (dirent* e = d ? readdir(d) : nullptr)
+    while (dirent* e = d ? (errno = 0, readdir(d)) : nullptr)
         if (strcmp(e->d_name, ".") != 0 && strcmp(e->d_name, "..") != 0) out.push_back(e->d_name);
+    if (d && errno != 0) ADD_FAILURE() << "listing " << dir << " failed: " << strerror(errno);
     if (d) closedir(d);
     std::sort(out.begin(), out.end());
     return out;
@@ -156,23 +157,18 @@ inline bool exits_with(pid_t pid, int code, int ms = 5000) {
     return status != -1 && WIFEXITED(status) && WEXITSTATUS(status) == code;
 }
 
-// A run's control block and semaphore, made as the controller makes them.
+// A run's control block with its semaphore, made as the controller makes them.
 struct RunBlock {
     int fd = ashmem_create_region(CONTROL_BLOCK_NAME, CONTROL_BLOCK_SIZE);
-    sem_t* sem = (sem_unlink(CONTROL_SEM_NAME), sem_open(CONTROL_SEM_NAME, O_CREAT, 0644, 1));
     ControlBlock* block = static_cast<ControlBlock*>(
         fd < 0 ? MAP_FAILED : mmap(nullptr, CONTROL_BLOCK_SIZE, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0));
+    sem_t* sem = block == MAP_FAILED ? nullptr : control_sem(block);
 
-    bool ok() const { return fd >= 0 && sem != SEM_FAILED && block != MAP_FAILED; }
-    // A fresh run's block: all clear, no reasons.
-    void reset() {
-        memset(block, 0, sizeof(*block));
-        for (int slot = SLOT_MAIN; slot <= SLOT_BT; slot++) block->slots[slot].reason = REASON_NONE;
-    }
+    bool ok() const { return fd >= 0 && block != MAP_FAILED; }
+    // A fresh run's block: all clear, no reasons, the semaphore free.
+    void reset() { ASSERT_EQ(control_block_init(block), 0); }
     ~RunBlock() {
         if (block != MAP_FAILED) munmap(block, CONTROL_BLOCK_SIZE);
-        if (sem != SEM_FAILED) sem_close(sem);
-        sem_unlink(CONTROL_SEM_NAME);
         if (fd >= 0) close(fd);
     }
 };
