@@ -20,12 +20,19 @@
 // Guards only the copy of the registered descriptors into the poll set.
 static pthread_mutex_t select_set_lock = PTHREAD_MUTEX_INITIALIZER;
 
-// A connection that has not sent its log type yet.
+// A connection that is not registered yet: it has not sent its log type, or
+// it has and waits for a connection accepted before it. Connections are
+// registered in the order they were accepted, so that of two connections of
+// one type the later one always takes over from the earlier one, whichever
+// letter happened to arrive first.
 struct PendingConn {
     int fd;           // -1 when the slot is free
-    int64_t expires;  // monotonic microseconds
+    int type;         // -1 until its letter has arrived
+    int64_t seq;      // order of acceptance
+    int64_t expires;  // monotonic microseconds; applies while type is -1
 };
 static PendingConn pending[MAX_PENDING];
+static int64_t accept_seq = 0;
 static bool pending_full_recorded = false;
 
 // Per type, while its connection lasts: whether dropping its data was recorded,
@@ -123,10 +130,33 @@ static void register_connection(int type, int fd) {
     WLOG(TAG_TRANSIST, WLOG_DEBUG, "accept over, new client:%c", LOG_TYPE_LETTERS[type]);
 }
 
+static void free_pending(int slot) {
+    pending[slot].fd = -1;
+    pending[slot].type = -1;
+    pending_full_recorded = false;
+}
+
+// Registers pending connections in the order they were accepted, as long as
+// the earliest one has named its type.
+static void register_in_order() {
+    for (;;) {
+        int first = -1;
+        for (int i = 0; i < MAX_PENDING; i++) {
+            if (pending[i].fd >= 0 && (first < 0 || pending[i].seq < pending[first].seq)) first = i;
+        }
+        if (first < 0 || pending[first].type < 0) return;
+        int fd = pending[first].fd;
+        int type = pending[first].type;
+        free_pending(first);
+        register_connection(type, fd);
+    }
+}
+
 static void close_pending(int slot) {
     close_fd(pending[slot].fd);
-    pending[slot].fd = -1;
-    pending_full_recorded = false;
+    free_pending(slot);
+    // It may have held up connections accepted after it.
+    register_in_order();
 }
 
 // Reads the one-byte log type of a pending connection, if it has arrived.
@@ -146,10 +176,8 @@ static void handle_pending(int slot) {
         close_pending(slot);
         return;
     }
-    int fd = pending[slot].fd;
-    pending[slot].fd = -1;
-    pending_full_recorded = false;
-    register_connection(type, fd);
+    pending[slot].type = type;
+    register_in_order();
 }
 
 static void accept_connections() {
@@ -183,6 +211,8 @@ static void accept_connections() {
             continue;
         }
         pending[slot].fd = fd;
+        pending[slot].type = -1;
+        pending[slot].seq = accept_seq++;
         pending[slot].expires = monotonic_us() + PENDING_TIMEOUT_MS * 1000LL;
         // Collectors send their letter right after connecting: usually it is
         // already here.
@@ -192,7 +222,7 @@ static void accept_connections() {
 
 static void expire_pending(int64_t now) {
     for (int i = 0; i < MAX_PENDING; i++) {
-        if (pending[i].fd >= 0 && now >= pending[i].expires) {
+        if (pending[i].fd >= 0 && pending[i].type < 0 && now >= pending[i].expires) {
             HLOG(TAG_TRANSIST, WLOG_WARN, "new client sent no log type in %d ms, closed",
                  PENDING_TIMEOUT_MS);
             close_pending(i);
@@ -225,8 +255,9 @@ static void build_poll_set(PollSet* set, bool with_registered, bool with_control
     }
     // Keep the first two entries' places so indexes stay fixed.
     while (set->count < 2) add_fd(set, -1, -1, -1);
+    // A connection that has named its type waits without being read.
     for (int i = 0; i < MAX_PENDING; i++) {
-        if (pending[i].fd >= 0) add_fd(set, pending[i].fd, i, -1);
+        if (pending[i].fd >= 0 && pending[i].type < 0) add_fd(set, pending[i].fd, i, -1);
     }
     if (!with_registered) return;
     pthread_mutex_lock(&select_set_lock);
@@ -275,12 +306,26 @@ static bool queue_full() {
     return paused;
 }
 
+// At a stop the collectors have ended: a letter that has not arrived never
+// will, and such a connection must not keep those accepted after it waiting.
+static void close_unnamed_pending() {
+    for (int i = 0; i < MAX_PENDING; i++) {
+        if (pending[i].fd < 0 || pending[i].type >= 0) continue;
+        handle_pending(i);
+        if (pending[i].fd >= 0 && pending[i].type < 0) {
+            HLOG(TAG_TRANSIST, WLOG_WARN, "new client sent no log type before the stop, closed");
+            close_pending(i);
+        }
+    }
+}
+
 // After stop_requested: the collectors have ended, so every connection
 // reaches its end soon; read them all to it, within a short deadline.
 static void drain_at_stop() {
     const int64_t deadline = monotonic_us() + STOP_DRAIN_MS * 1000LL;
     for (;;) {
         if (transist_listen_fd >= 0) accept_connections();
+        close_unnamed_pending();
         PollSet set;
         build_poll_set(&set, true, false);
         if (set.count == 2) break;
@@ -302,7 +347,8 @@ static void drain_at_stop() {
     }
     pthread_mutex_unlock(&file_table_lock);
     for (int i = 0; i < MAX_PENDING; i++) {
-        if (pending[i].fd >= 0) close_pending(i);
+        close_fd(pending[i].fd);
+        free_pending(i);
     }
 }
 
@@ -318,7 +364,7 @@ void* read_thread(void*) {
     pthread_mutex_lock(&file_table_lock);
     for (LogFile& entry : log_files) entry.sock = -1;
     pthread_mutex_unlock(&file_table_lock);
-    for (PendingConn& conn : pending) conn.fd = -1;
+    for (PendingConn& conn : pending) conn = {-1, -1, 0, 0};
     for (bool& recorded : drop_recorded) recorded = false;
     pending_full_recorded = false;
     malloc_failure_recorded = false;
@@ -336,7 +382,7 @@ void* read_thread(void*) {
         int timeout_ms = 1000;
         int64_t now = monotonic_us();
         for (const PendingConn& conn : pending) {
-            if (conn.fd < 0) continue;
+            if (conn.fd < 0 || conn.type >= 0) continue;
             int64_t left = (conn.expires - now) / 1000 + 1;
             if (left < timeout_ms) timeout_ms = left > 0 ? static_cast<int>(left) : 0;
         }
