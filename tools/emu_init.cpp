@@ -88,12 +88,24 @@ static int run_tool(const char* const argv[]) {
     return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
 
+// The next entry of dir, or null at the end. A listing that fails half-way
+// is recorded: it must not pass for a complete one.
+static struct dirent* next_entry(DIR* dir, const char* path) {
+    errno = 0;
+    struct dirent* entry = readdir(dir);
+    if (entry == nullptr && errno != 0) init_log("cannot list %s: %s", path, strerror(errno));
+    return entry;
+}
+
 // Non-persistent properties vanish at each boot.
 static void clear_property_area() {
     DIR* dir = opendir(PROPERTY_AREA_DIR);
-    if (dir == nullptr) return;
+    if (dir == nullptr) {
+        init_log("cannot open %s: %s", PROPERTY_AREA_DIR, strerror(errno));
+        return;
+    }
     struct dirent* entry;
-    while ((entry = readdir(dir)) != nullptr) {
+    while ((entry = next_entry(dir, PROPERTY_AREA_DIR)) != nullptr) {
         if (strcmp(entry->d_name, ".") == 0 || strcmp(entry->d_name, "..") == 0) continue;
         if (unlinkat(dirfd(dir), entry->d_name, 0) != 0)
             init_log("cannot remove property %s: %s", entry->d_name, strerror(errno));
@@ -193,9 +205,12 @@ static void load_build_prop(const char* path) {
 
 static void load_persistent_properties() {
     DIR* dir = opendir(PROPERTY_PERSIST_DIR);
-    if (dir == nullptr) return;
+    if (dir == nullptr) {
+        init_log("cannot open %s: %s", PROPERTY_PERSIST_DIR, strerror(errno));
+        return;
+    }
     struct dirent* entry;
-    while ((entry = readdir(dir)) != nullptr) {
+    while ((entry = next_entry(dir, PROPERTY_PERSIST_DIR)) != nullptr) {
         const char* key = entry->d_name;
         if (!property_key_valid(key) || strncmp(key, "persist.", 8) != 0) continue;
         char value[PROPERTY_VALUE_MAX];

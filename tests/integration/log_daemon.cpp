@@ -2,8 +2,10 @@
 
 #include <ctype.h>
 #include <dirent.h>
+#include <errno.h>
 #include <stdio.h>
 #include <stdlib.h>
+#include <string.h>
 
 #include <algorithm>
 
@@ -88,9 +90,10 @@ std::vector<std::string> run_folders(const EmuPhone& phone, const std::string& c
     std::string root = phone.host_path(card + "/qrvlog/tavlolog");
     DIR* dir = root.empty() ? nullptr : opendir(root.c_str());
     if (dir == nullptr) return names;
-    while (struct dirent* entry = readdir(dir)) {
+    while (struct dirent* entry = (errno = 0, readdir(dir))) {
         if (std::string(entry->d_name).compare(0, 6, "APLog_") == 0) names.push_back(entry->d_name);
     }
+    if (errno != 0) ADD_FAILURE() << "listing " << root << " failed: " << strerror(errno);
     closedir(dir);
     std::sort(names.begin(), names.end());
     return names;
