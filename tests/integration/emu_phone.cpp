@@ -249,6 +249,7 @@ bool EmuPhone::boot(const BootOptions& options) {
 
     std::vector<std::string> args = {"boot", dir_, "--boot-mode", options.boot_mode};
     if (options.real_kmsg) args.push_back("--real-kmsg");
+    if (options.ready_at_run) args.push_back("--ready-at-run");
     if (options.sdcard_mb > 0) {
         args.push_back("--sdcard-size");
         args.push_back(std::to_string(options.sdcard_mb));
