@@ -102,6 +102,10 @@ int32_t tgid_of(pid_t tid) {
     return at != nullptr ? static_cast<int32_t>(atoi(at + 6)) : tid;
 }
 
+Reader* reader_of(const struct fuse_file_info* fi) {
+    return reinterpret_cast<Reader*>(static_cast<uintptr_t>(fi->fh));
+}
+
 // Sends the reader's next entry; 0 when there is none.
 bool reply_entry(fuse_req_t req, Reader* reader, size_t size) {
     const LoggerRing& ring = *g_present[reader->buffer];
@@ -232,7 +236,7 @@ void op_open(fuse_req_t req, fuse_ino_t ino, struct fuse_file_info* fi) {
         reader->pos = g_present[buffer]->oldest();
         reader->next = g_readers[buffer];
         g_readers[buffer] = reader;
-        fi->fh = reinterpret_cast<uint64_t>(reader);
+        fi->fh = static_cast<uint64_t>(reinterpret_cast<uintptr_t>(reader));
     }
     if (fuse_reply_open(req, fi) != 0 && fi->fh != 0) {
         // The opener is gone (interrupted): no release will come.
@@ -244,7 +248,7 @@ void op_open(fuse_req_t req, fuse_ino_t ino, struct fuse_file_info* fi) {
 }
 
 void op_release(fuse_req_t req, fuse_ino_t, struct fuse_file_info* fi) {
-    Reader* reader = reinterpret_cast<Reader*>(fi->fh);
+    Reader* reader = reader_of(fi);
     if (reader != nullptr) {
         for (Reader** p = &g_readers[reader->buffer]; *p != nullptr; p = &(*p)->next) {
             if (*p == reader) {
@@ -260,7 +264,7 @@ void op_release(fuse_req_t req, fuse_ino_t, struct fuse_file_info* fi) {
 }
 
 void op_read(fuse_req_t req, fuse_ino_t, size_t size, off_t, struct fuse_file_info* fi) {
-    Reader* reader = reinterpret_cast<Reader*>(fi->fh);
+    Reader* reader = reader_of(fi);
     if (reader == nullptr) {
         fuse_reply_err(req, EBADF);
         return;
@@ -315,7 +319,7 @@ void op_write(fuse_req_t req, fuse_ino_t ino, const char* buf, size_t size, off_
 }
 
 void op_poll(fuse_req_t req, fuse_ino_t, struct fuse_file_info* fi, struct fuse_pollhandle* ph) {
-    Reader* reader = reinterpret_cast<Reader*>(fi->fh);
+    Reader* reader = reader_of(fi);
     unsigned revents = POLLOUT | POLLWRNORM;
     if (reader != nullptr) {
         const LoggerRing& ring = *g_present[reader->buffer];
@@ -405,6 +409,15 @@ int main(int argc, char** argv) {
         }
         close(ready[0]);
         setsid();
+        // Whoever started us may wait for the end of our output: keep none
+        // of it; errors go to the phone's console when there is one.
+        int null_fd = open("/dev/null", O_RDWR | O_CLOEXEC);
+        int console = open("/dev/emu/console.log", O_WRONLY | O_APPEND | O_CLOEXEC | O_NOFOLLOW);
+        dup2(null_fd, 0);
+        dup2(null_fd, 1);
+        dup2(console >= 0 ? console : null_fd, 2);
+        if (console >= 0) close(console);
+        if (null_fd >= 0) close(null_fd);
     }
 
     struct fuse_lowlevel_ops ops;

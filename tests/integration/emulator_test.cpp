@@ -118,7 +118,8 @@ TEST(EmulatorTest, StopLeavesNothingRunning) {
     ASSERT_GT(init, 0);
     std::string ns = read_link("/proc/" + std::to_string(init) + "/ns/pid");
     ASSERT_FALSE(ns.empty());
-    auto sleeper = phone.spawn({"sleep", "1000"});
+    // A reader blocked on a logger device must not hold the power-off up.
+    auto sleeper = phone.spawn({"cat", "/dev/log/main"});
     ASSERT_TRUE(sleeper);
     ASSERT_TRUE(EmuPhone::wait_for([&] { return processes_in_pid_namespace(ns) >= 3; }, 5000));
 
@@ -131,6 +132,36 @@ TEST(EmulatorTest, StopLeavesNothingRunning) {
     mounts << std::ifstream("/proc/self/mountinfo").rdbuf();
     EXPECT_EQ(std::string::npos, mounts.str().find(phone.image_dir()));
     EXPECT_NE(0, phone.exec({"true"}));
+}
+
+TEST(EmulatorTest, BootOptionsShapeTheLoggerDevicesAndBluetoothService) {
+    struct Row {
+        bool system_log;
+        bool btlog;
+        int logger_kb;
+        const char* kept;  // of two 3016-byte entries, as dd counts it
+    } rows[] = {
+        {true, true, 0, "6032 bytes"},
+        {false, false, 4, "3016 bytes"},
+    };
+    for (const Row& row : rows) {
+        SCOPED_TRACE(row.logger_kb);
+        EmuPhone phone;
+        BootOptions options;
+        options.system_log = row.system_log;
+        options.btlog = row.btlog;
+        options.logger_kb = row.logger_kb;
+        ASSERT_TRUE(phone.boot(options));
+        std::string out;
+        EXPECT_EQ(row.system_log, phone.exec({"test", "-e", "/dev/log/system"}) == 0);
+        EXPECT_EQ(0, phone.exec({"cat", "/proc/net/unix"}, &out));
+        EXPECT_EQ(row.btlog, out.find("@btlog") != std::string::npos);
+        std::string text(2990, 'x');
+        ASSERT_EQ(0, phone.exec({"sh", "-c", "log " + text + " && log " + text}));
+        // dd ends with EAGAIN once it has read every entry.
+        phone.exec({"sh", "-c", "dd if=/dev/log/main of=/dev/null bs=5120 iflag=nonblock 2>&1"}, &out);
+        EXPECT_NE(std::string::npos, out.find(row.kept)) << out;
+    }
 }
 
 TEST(EmulatorTest, RebootKeepsPersistentPropertiesAndData) {
