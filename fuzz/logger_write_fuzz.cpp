@@ -12,6 +12,7 @@
 #include <string.h>
 #include <time.h>
 
+#include <algorithm>
 #include <random>
 #include <string>
 #include <vector>
@@ -31,8 +32,7 @@ unsigned long seed = DEFAULT_SEED;
 size_t pick(size_t n) { return n == 0 ? 0 : static_cast<size_t>(rng() % n); }
 
 [[noreturn]] void fail(const char* what, int buffer) {
-    fprintf(stderr, "logger_write_fuzz: FAILED at iteration %lu (seed %lu), buffer %d: %s\n", iteration, seed,
-            buffer, what);
+    fprintf(stderr, "logger_write_fuzz: FAILED at iteration %lu (seed %lu), buffer %d: %s\n", iteration, seed, buffer, what);
     abort();
 }
 
@@ -70,13 +70,10 @@ std::string random_bytes(size_t n) {
     return s;
 }
 
+// Empty, small, around the payload limit, anything.
 size_t random_len() {
-    switch (pick(4)) {
-        case 0: return pick(4);
-        case 1: return pick(200);
-        case 2: return LOGGER_MAX_PAYLOAD - 2 + pick(5);
-        default: return pick(6000);
-    }
+    const size_t lens[] = {pick(4), pick(200), LOGGER_MAX_PAYLOAD - 2 + pick(5), pick(6000)};
+    return lens[pick(4)];
 }
 
 std::string entry_of(const LoggerHeader& header, const std::string& payload) {
@@ -99,12 +96,10 @@ void device_write(int b) {
 
 void inject_write() {
     static const char* const names[] = {"main", "system", "radio", "events", "kernel", "", "mainx"};
-    std::string bytes;
-    switch (pick(4)) {
-        case 0: bytes = random_bytes(pick(64)); break;
-        case 1: bytes = std::string(names[pick(7)]) + random_bytes(pick(40)); break;
-        default: bytes = std::string(names[pick(7)]) + '\0' + random_bytes(LOGGER_HEADER_LEN + random_len());
-    }
+    std::string name = names[pick(7)];
+    const std::string choices[] = {random_bytes(pick(64)), name + random_bytes(pick(40)),
+                                   name + '\0' + random_bytes(LOGGER_HEADER_LEN + random_len())};
+    std::string bytes = choices[std::min<size_t>(pick(4), 2)];
     long taken = logger_inject_write(rings, bytes.data(), bytes.size());
 
     // The model's reading of the same bytes.

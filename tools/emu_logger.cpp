@@ -37,7 +37,7 @@ namespace {
 constexpr gid_t AID_LOG = 1007;
 constexpr fuse_ino_t INJECT_INO = 2 + LOGGER_BUFFER_COUNT;
 constexpr double CACHE_SECONDS = 3600;  // the tree never changes while mounted
-constexpr int MAX_READERS = 1024;        // bounds what openers can make us hold
+constexpr int MAX_READERS = 16384;       // bounds what openers can make us hold (48 bytes each)
 
 // One open for reading; the descriptor's file handle points at it.
 struct Reader {
