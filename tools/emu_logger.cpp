@@ -89,17 +89,46 @@ bool attr_of(fuse_ino_t ino, struct stat* st) {
     return true;
 }
 
-// The writer's process id: the request carries its thread id.
-int32_t tgid_of(pid_t tid) {
-    char path[32];
-    snprintf(path, sizeof(path), "/proc/%d/status", static_cast<int>(tid));
-    UniqueFd fd(RETRY_EINTR(open(path, O_RDONLY | O_CLOEXEC)));
+// A writer's process id: the request carries its thread id. Reading
+// /proc/TID/status costs more than the rest of a write, so recent writers are
+// remembered with a handle on their /proc folder: it tells whether that very
+// thread still lives, so a reused thread id is never taken for the old one.
+struct KnownWriter {
+    pid_t tid = 0;
+    int32_t tgid = 0;
+    int dir = -1;
+};
+KnownWriter g_writers[16];
+unsigned g_next_writer = 0;
+
+int32_t tgid_in(int dir, pid_t tid) {
+    UniqueFd fd(RETRY_EINTR(openat(dir, "status", O_RDONLY | O_CLOEXEC)));
     char text[512];
     ssize_t n = fd.ok() ? RETRY_EINTR(read(fd.get(), text, sizeof(text) - 1)) : -1;
     if (n <= 0) return tid;
     text[n] = '\0';
     const char* at = strstr(text, "\nTgid:");
     return at != nullptr ? static_cast<int32_t>(atoi(at + 6)) : tid;
+}
+
+int32_t pid_of_writer(pid_t tid) {
+    for (KnownWriter& w : g_writers) {
+        if (w.tid != tid) continue;
+        if (faccessat(w.dir, "status", F_OK, 0) == 0) return w.tgid;
+        close(w.dir);
+        w = KnownWriter();
+        break;
+    }
+    char path[32];
+    snprintf(path, sizeof(path), "/proc/%d", static_cast<int>(tid));
+    int dir = RETRY_EINTR(open(path, O_PATH | O_DIRECTORY | O_CLOEXEC));
+    if (dir < 0) return tid;
+    KnownWriter& slot = g_writers[g_next_writer++ % 16];
+    if (slot.dir >= 0) close(slot.dir);
+    slot.tid = tid;
+    slot.tgid = tgid_in(dir, tid);
+    slot.dir = dir;
+    return slot.tgid;
 }
 
 Reader* reader_of(const struct fuse_file_info* fi) {
@@ -296,7 +325,7 @@ void op_write(fuse_req_t req, fuse_ino_t ino, const char* buf, size_t size, off_
     if (buffer >= 0) {
         // pid 0: a writer outside the phone (the host through its root).
         int32_t tid = ctx->pid;
-        int32_t pid = tid > 0 ? tgid_of(tid) : 0;
+        int32_t pid = tid > 0 ? pid_of_writer(tid) : 0;
         struct timespec now;
         clock_gettime(CLOCK_REALTIME, &now);
         size_t kept = logger_device_write(g_present[buffer], pid, tid, now, buf, size);
