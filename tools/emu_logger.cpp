@@ -135,7 +135,8 @@ Reader* reader_of(const struct fuse_file_info* fi) {
     return reinterpret_cast<Reader*>(static_cast<uintptr_t>(fi->fh));
 }
 
-// Sends the reader's next entry; 0 when there is none.
+// Answers the read with the reader's next entry (or EINVAL when it does not
+// fit); false, with nothing sent, when the reader has read everything.
 bool reply_entry(fuse_req_t req, Reader* reader, size_t size) {
     const LoggerRing& ring = *g_present[reader->buffer];
     reader->pos = ring.clamp(reader->pos);
