@@ -197,7 +197,11 @@ TEST(EmulatorTest, DaemonIsRestartedAfterItEnds) {
     pid_t first = phone.daemon_pid();
     ASSERT_GT(first, 0);
     ASSERT_EQ(0, phone.exec({"kill", "-9", std::to_string(first)}));
-    auto restarted = [&] { return phone.daemon_pid() > 0 && phone.daemon_pid() != first; };
+    // One read: the pid file of the killed daemon may vanish between two.
+    auto restarted = [&] {
+        pid_t now = phone.daemon_pid();
+        return now > 0 && now != first;
+    };
     ASSERT_TRUE(EmuPhone::wait_for(restarted, 10000));
     std::string log = phone.read_file("/dev/emu/init.log");
     EXPECT_NE(std::string::npos,
