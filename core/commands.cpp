@@ -72,7 +72,7 @@ static int prepare_run(LogController* controller) {
 
 // Starts a run in the folder prepare_run made.
 static void launch_run(LogController* controller) {
-    publish_run_folder(controller->run_folder);
+    publish_run_folder(controller, controller->run_folder);
     controller->rotate_size_kb = calc_rotate_size(controller, controller->logsize);
     start_logging(controller);
 }

@@ -88,16 +88,8 @@ int append_record(int dirfd, const char* line, size_t len) {
 // for it; a folder of unknown origin is trusted up to its parent only.
 void append_run_record(const char* folder, const char* line, size_t len) {
     char parent[PATH_LEN];
-    const char* root = trusted_root_of(folder, run_folder_root);
-    if (root == nullptr) {
-        copy_str(parent, sizeof(parent), folder);
-        size_t n = strlen(parent);
-        while (n > 1 && parent[n - 1] == '/') parent[--n] = '\0';
-        char* slash = strrchr(parent, '/');
-        if (slash == nullptr) return;
-        slash[slash == parent ? 1 : 0] = '\0';
-        root = parent;
-    }
+    const char* root = trusted_root_for(folder, run_folder_root, parent);
+    if (root == nullptr) return;
     UniqueFd dir(safe_open_dir(root, folder, false, 0));
     if (!dir.ok()) return;
     UniqueFd fd(append_record(dir.get(), line, len));

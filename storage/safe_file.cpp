@@ -172,6 +172,17 @@ const char* trusted_root_of(const char* path, const char* logpath) {
     return nullptr;
 }
 
+const char* trusted_root_for(const char* path, const char* logpath, char* buf) {
+    const char* root = trusted_root_of(path, logpath);
+    if (root != nullptr || path == nullptr || path[0] != '/') return root;
+    copy_str(buf, PATH_LEN, path);
+    size_t n = strlen(buf);
+    while (n > 1 && buf[n - 1] == '/') buf[--n] = '\0';
+    char* slash = strrchr(buf, '/');
+    slash[slash == buf ? 1 : 0] = '\0';
+    return buf;
+}
+
 int safe_open_dir(const char* root, const char* path, bool create, mode_t mode, char* failed_at) {
     if (failed_at) failed_at[0] = '\0';
     if (root == nullptr || path == nullptr || !is_below(path, root)) {

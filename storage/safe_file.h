@@ -24,6 +24,11 @@
 // it), else "/data" for paths below /data, else nullptr. logpath may be null.
 const char* trusted_root_of(const char* path, const char* logpath);
 
+// trusted_root_of, or for a path below neither its parent folder (copied into
+// buf, PATH_LEN bytes): then only its last component is opened without
+// following links. nullptr for a path that is not absolute.
+const char* trusted_root_for(const char* path, const char* logpath, char* buf);
+
 // Opens the folder path, which must be root or lie below it. With create,
 // missing folders (the root's own ones included) are made with mode.
 // failed_at (PATH_LEN bytes, may be null) gets the path up to the component

@@ -67,7 +67,7 @@ TEST(ComposeRunFolder, NamesTheFolderAfterTheStartTime) {
 }
 
 TEST(CreateRunFolder, CreatesEveryMissingFolderWithGroupAccessOrRefuses) {
-    umask(0);
+    umask(077);  // the modes do not depend on it
     LogController controller;
     const struct {
         const char *base, *path, *created;  // the last folder, with its slash
@@ -88,8 +88,13 @@ TEST(CreateRunFolder, CreatesEveryMissingFolderWithGroupAccessOrRefuses) {
 
     write_file("/data/blocker", "");
     EXPECT_EQ(create_run_folder(&controller, "/data", "/data/blocker/run"), -1);
-    EXPECT_TRUE(history_has("mkdir /data/blocker/run fails, errno:Not a directory(20)"));
+    EXPECT_TRUE(history_has("mkdir /data/blocker fails, errno:Not a directory(20)"));
     EXPECT_TRUE(history_has("mkdir /data/blocker/run/ fails at last"));
+
+    // A link planted on the card (the log path itself may be one).
+    ASSERT_EQ(system("mkdir /data/elsewhere && ln -s /data/elsewhere /mnt/sdcard/qrvlog/next"), 0);
+    EXPECT_EQ(create_run_folder(&controller, "/mnt/sdcard", "/mnt/sdcard/qrvlog/next/APLog_1/"), -1);
+    EXPECT_TRUE(files_in("/data/elsewhere").empty());
 
     std::string too_long = "/data/" + std::string(249, 'y');  // 255 characters, no room for '/'
     EXPECT_EQ(create_run_folder(&controller, "/data", too_long.c_str()), -1);
@@ -98,10 +103,11 @@ TEST(CreateRunFolder, CreatesEveryMissingFolderWithGroupAccessOrRefuses) {
 }
 
 TEST(PublishRunFolder, AFolderTooLongForThePropertyClearsIt) {
-    publish_run_folder("/mnt/sdcard/qrvlog/tavlolog/APLog_2026_0304_070649/");
+    LogController controller;
+    publish_run_folder(&controller, "/mnt/sdcard/qrvlog/tavlolog/APLog_2026_0304_070649/");
     EXPECT_EQ(property(PROP_REALPATH), "/mnt/sdcard/qrvlog/tavlolog/APLog_2026_0304_070649/");
     std::string long_folder = "/mnt/" + std::string(90, 'd') + "/qrvlog/tavlolog/APLog_2026_0304_070650/";
-    publish_run_folder(long_folder.c_str());
+    publish_run_folder(&controller, long_folder.c_str());
     EXPECT_EQ(property(PROP_REALPATH), "") << "the earlier run's folder would receive this run's records";
     EXPECT_TRUE(history_has("set debug.TQ.realpath to " + long_folder + " failed"));
 }
