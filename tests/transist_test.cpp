@@ -206,6 +206,28 @@ TEST_F(TransistTest, LaterConnectionOfATypeTakesOverAfterTheEarlierOnesData) {
     EXPECT_TRUE(history_has("main_log connection replaced by a new one"));
 }
 
+// Only the daemon's own processes may feed "log_socket": another process is
+// closed at once, never displaces a collector and lands nothing in a file.
+TEST_F(TransistTest, ConnectionsOfOtherProcessesAreRefused) {
+    start();
+    int collector = connect_log_socket("Kreal\n");
+    pid_t child = fork();
+    if (child == 0) {
+        if (fork() == 0) {  // a grandchild: no child of this "daemon" once its parent is gone
+            while (getppid() != 1) usleep(1000);
+            int fd = connect_log_socket("Kforged\n");
+            _exit(closed_by_peer(fd, 5000) ? 0 : 1);
+        }
+        _exit(0);
+    }
+    ASSERT_TRUE(exits_with(child, 0));
+    ASSERT_TRUE(wait_for([] { return history_has("refuse log_socket client uid 0 pid "); }, 5000));
+    send_all(collector, "still real\n");
+    close(collector);
+    stop();
+    EXPECT_EQ(log("kernel_log"), kHeader + "real\nstill real\n");
+}
+
 TEST_F(TransistTest, CollectorEndIsRecordedAndTheTypeCanReconnect) {
     start();
     stream_log('R', "one\n");
