@@ -10,6 +10,7 @@
 #include "common/io_util.h"
 #include "common/wlog.h"
 #include "config/config_store.h"
+#include "config/log_path.h"
 #include "core/client_table.h"
 #include "core/control_socket.h"
 #include "core/log_controller.h"
@@ -209,8 +210,9 @@ int handle_client_message(LogController* controller, int fd) {
         return 0;
     }
     // The last byte is the command's terminator. The text is taken up to its
-    // first NUL, so bytes a client sent after one are ignored.
+    // first NUL; a command word ignores what follows it anyway.
     message[n - 1] = '\0';
+    bool inner_nul = strlen(message) < static_cast<size_t>(n - 1);
     char shown[PRINTABLE_MAX];
     HLOG(TAG_MAIN, WLOG_INFO, "recv '%s' from client %d", printable(message, shown, sizeof(shown)),
          fd);
@@ -232,21 +234,27 @@ int handle_client_message(LogController* controller, int fd) {
             break;
     }
     // Configuration messages are answered with their trimmed text (leading
-    // spaces kept), valid or not: the reply confirms receipt, not the change.
-    apply_config_message(controller, message);
-    reply_word(controller, fd, message, REPLY_DONE);
+    // spaces kept) and ",1", or ",0" when the value was refused as unsafe to
+    // store; a message that is no setting at all is only recorded.
+    int stored;
+    if (inner_nul) {
+        // What follows the NUL would be stored or lost unseen.
+        trim(message);
+        HLOG(TAG_MAIN, WLOG_ERROR, "%s is not a valid configure (NUL byte)",
+             printable(message, shown, sizeof(shown)));
+        stored = 0;
+    } else {
+        stored = apply_config_message(controller, message);
+    }
+    reply_word(controller, fd, message, stored ? REPLY_DONE : REPLY_FAILED);
     return 1;
 }
 
 // Why a configuration text cannot be stored, or nullptr when it can.
 static const char* config_fault(const char* key, const char* value) {
-    for (const char* p = key; *p; p++) {
-        if (static_cast<unsigned char>(*p) < 0x20 || *p == 0x7f) return "control character";
-    }
-    // A line feed in a value would add a line of its own to the configuration file.
-    for (const char* p = value; *p; p++) {
-        if (static_cast<unsigned char>(*p) < 0x20 || *p == 0x7f) return "control character";
-    }
+    // A line feed would add a line of its own to the configuration file;
+    // other bytes (a trailing "\r", a tab) are stored as they come.
+    if (strchr(key, '\n') != nullptr || strchr(value, '\n') != nullptr) return "line feed";
     // Items hold at most CONFIG_FIELD_LEN - 1 characters and a stored line
     // "key=value\n" at most 99: a longer value would be stored cut.
     size_t key_len = strlen(key), value_len = strlen(value);
@@ -254,10 +262,11 @@ static const char* config_fault(const char* key, const char* value) {
         value_len >= static_cast<size_t>(CONFIG_FIELD_LEN) || key_len + value_len > 97) {
         return "too long";
     }
+    if (strcmp(key, "logpath") == 0 && !log_path_value_valid(value)) return "not an absolute path";
     return nullptr;
 }
 
-void apply_config_message(LogController* controller, char* text) {
+int apply_config_message(LogController* controller, char* text) {
     (void)controller;
     char* message = trim(text);
     char shown[PRINTABLE_MAX];
@@ -266,7 +275,7 @@ void apply_config_message(LogController* controller, char* text) {
     if (!equal) {
         HLOG(TAG_MAIN, WLOG_ERROR, "%s is not a valid configure",
              printable(message, shown, sizeof(shown)));
-        return;
+        return 1;
     }
     char key[CONTROL_MSG_MAX + 1];
     char value[CONTROL_MSG_MAX + 1];
@@ -284,7 +293,7 @@ void apply_config_message(LogController* controller, char* text) {
         if (!underscore) {
             HLOG(TAG_MAIN, WLOG_ERROR, "%s is not a valid configure",
                  printable(message, shown, sizeof(shown)));
-            return;
+            return 1;
         }
         real_key = underscore + 1;
     }
@@ -292,11 +301,12 @@ void apply_config_message(LogController* controller, char* text) {
     if (fault) {
         HLOG(TAG_MAIN, WLOG_ERROR, "%s is not a valid configure (%s)",
              printable(message, shown, sizeof(shown)), fault);
-        return;
+        return 0;
     }
 
     WLOG(TAG_MAIN, WLOG_DEBUG, "new config, key: %s, value:%s", real_key, value);
     ConfigCache cache;
     config_init(&cache);
     config_change(&cache, real_key, value);
+    return 1;
 }
