@@ -88,7 +88,7 @@ static int start_by_command(LogController* controller, int fd, const char* word)
 }
 
 static int cmd_deep_start(LogController* controller, int fd) {
-    if (is_running()) {
+    if (run_live(controller)) {
         HLOG(TAG_MAIN, WLOG_INFO, "tqlog already running, why send deep_start");
         reply_word(controller, fd, CMD_DEEP_START, REPLY_DONE);
         return 1;
@@ -103,7 +103,7 @@ static int cmd_deep_start(LogController* controller, int fd) {
 }
 
 static int cmd_start(LogController* controller, int fd) {
-    if (is_running()) {
+    if (run_live(controller)) {
         HLOG(TAG_MAIN, WLOG_INFO, "tqlog already running, why send start");
         reply_word(controller, fd, CMD_START, REPLY_DONE);
         return 1;
@@ -144,7 +144,7 @@ static int move_run_to_log_path(LogController* controller, int fd) {
 }
 
 static int cmd_copy(LogController* controller, int fd) {
-    if (is_running()) {
+    if (run_live(controller)) {
         if (controller->log_path_state == 1) {
             HLOG(TAG_MAIN, WLOG_ERROR, "has copyed to sd,ignore this 'copy'");
             reply_word(controller, fd, CMD_COPY, REPLY_DONE);

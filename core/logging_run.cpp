@@ -170,6 +170,7 @@ void start_logging(LogController* controller) {
     if (controller->boot_mode == 0) oru_mode_on();
     set_logsize_property(controller->rotate_size_kb);
     property_set(PROP_RUNNING, "1");
+    controller->run_active = true;
 
     transist_create(controller, controller->run_folder, controller->rotate_size_kb);
     create_control_block(controller);
@@ -248,12 +249,22 @@ static void join_transist_thread(pthread_t* thread, const char* which) {
     }
 }
 
+// A notice the writer sent while the run was stopping belongs to that run;
+// left in the counter it would stop the next run as soon as it starts.
+static void discard_stale_notices() {
+    uint64_t stale;
+    while (efd_thread >= 0 && RETRY_EINTR(read(efd_thread, &stale, sizeof(stale))) > 0) {
+    }
+}
+
 void stop_logging(LogController* controller) {
     // The collectors ended below are reaped by the system and start no check.
     signal(SIGCHLD, SIG_IGN);
-    controller->log_path_state = -1;
-    if (!is_running()) {
+    // The daemon's own record decides: the property may have been set by hand.
+    if (!controller->run_active) {
+        controller->log_path_state = -1;
         HLOG(TAG_MAIN, WLOG_ERROR, "tavlolog already stopped, ignore this stop");
+        if (is_running()) property_set(PROP_RUNNING, "0");
         return;
     }
     property_set(PROP_RUNNING, "0");
@@ -283,6 +294,11 @@ void stop_logging(LogController* controller) {
     join_transist_thread(&read_thread_id, "read");
     join_transist_thread(&write_thread_id, "write");
     stop_requested = false;
+    controller->run_active = false;
+    // Only now: until the writer has ended it must check the free space of
+    // the run's own root (/data for a run held there), not the card's.
+    controller->log_path_state = -1;
+    discard_stale_notices();
     HLOG(TAG_MAIN, WLOG_INFO, "tavlolog stop done");
 }
 

@@ -173,6 +173,20 @@ TEST_F(ControlSocketTest, CommandsWhileRunning) {
     ASSERT_EQ(0, property_set(PROP_RUNNING, "0"));
 }
 
+// The daemon's own record of a live run decides too: the shell can set
+// debug.TQ.running, and "0" must not let a start build a second run.
+TEST_F(ControlSocketTest, LiveRunIsKnownWhateverTheProperty) {
+    write_config("autostart=0\nlogpath=/data\nlogsize=300\nAndroidLog=0\nKernelLog=0\nBTLog=0\ntotallogsize=600\n");
+    auto conn = connect_client();
+    EXPECT_EQ("start,1", exchange(conn.get(), "start"));
+    ASSERT_EQ(0, property_set(PROP_RUNNING, "0"));
+    EXPECT_EQ("start,1", exchange(conn.get(), "start"));
+    EXPECT_TRUE(history_has("tqlog already running, why send start"));
+    EXPECT_EQ("stop,1", exchange(conn.get(), "stop"));
+    EXPECT_TRUE(history_has("tavlolog stop done"));
+    EXPECT_EQ(count_of(read_file(kHistory), "create read/write thread success"), 1u);
+}
+
 // A start whose folder cannot be made answers ",0" and drops the client.
 TEST_F(ControlSocketTest, StartFailsWithoutFolder) {
     write_config(config_with("logpath=/proc/tqlog"));

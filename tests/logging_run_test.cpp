@@ -261,6 +261,27 @@ TEST_F(RunTest, StopWithNoCollectorToWaitForIsQuick) {
     EXPECT_FALSE(history_has("tavlolog stop done"));
 }
 
+// A run held in /data while the card is gone: until the writer has ended it
+// checks /data, and a notice sent during the stop does not outlive it.
+TEST_F(RunTest, StopLeavesNoFalseOrStaleStorageNotice) {
+    strcpy(controller_.logpath, "/mnt/no_card");
+    controller_.log_path_state = 0;
+    start_logging(&controller_);
+    pid_t slow = fork();  // ignores the stop request: the stop waits its full second
+    if (slow == 0) {
+        signal(SIGUSR1, SIG_IGN);
+        pause();
+        _exit(0);
+    }
+    controller_.mlog_pid = slow;
+    controller_.shm->slots[SLOT_MAIN].exited = 0;
+    uint64_t notice = 1001;
+    ASSERT_EQ(write(efd_thread, &notice, sizeof(notice)), 8);
+    stop_logging(&controller_);
+    EXPECT_FALSE(history_has("no space to write log"));
+    EXPECT_EQ(read(efd_thread, &notice, sizeof(notice)), -1) << "a stale notice would stop the next run";
+}
+
 // A collector that ends with a reason is reported with it; the last one to end
 // stops the run and every client hears of it.
 TEST_F(RunTest, CollectorThatCannotOpenItsSourceStopsTheRun) {
