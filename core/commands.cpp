@@ -57,7 +57,7 @@ static void load_path_and_size(LogController* controller) {
     if ((value = config_get(&cache, "logpath"))) {
         copy_str(controller->logpath, sizeof(controller->logpath), value);
     }
-    if ((value = config_get(&cache, "logsize"))) controller->logsize = atoi(value);
+    if ((value = config_get(&cache, "logsize"))) controller->logsize = logsize_from(value);
 }
 
 // Loads the options and names and creates the run folder. Returns 1, or 0

@@ -75,6 +75,11 @@ extern int data_storage_low;
 #define PROP_REALPATH "debug.TQ.realpath"
 #define PROP_LOGSIZE "debug.TQ.logsize"
 
+// The size of a run in MB from a logsize value; one that is not a positive
+// number is recorded and gives the default.
+constexpr int DEFAULT_LOGSIZE_MB = 300;
+int logsize_from(const char* value);
+
 // atoi of debug.TQ.running (default "0") is not 0.
 bool is_running();
 

@@ -9,6 +9,7 @@
 #include <thread>
 
 #include "collectors/kmsg_cat.h"
+#include "config/config_store.h"
 #include "core/child_supervision.h"
 #include "core/log_controller.h"
 #include "test_util.h"
@@ -42,6 +43,22 @@ TEST(CalcRotateSize, SplitsTheRunSizeOverItsFiles) {
         EXPECT_EQ(calc_rotate_size(&controller, c.megabytes), c.expect_kb) << c.files << " " << c.megabytes;
     }
     EXPECT_TRUE(history_has("Invalid log file num:0"));
+}
+
+TEST(RunSize, ZeroNegativeOrGarbageGiveTheDefault) {
+    const struct {
+        const char* value;
+        int mb;
+    } cases[] = {{"60", 60}, {"200\r", 200}, {"0", 300}, {"-5", 300}, {"abc", 300}, {"12abc", 300}, {"", 300}};
+    for (const auto& c : cases) {
+        ConfigCache cache;
+        config_set_defaults(&cache);
+        strcpy(cache.items[2].value, c.value);  // logsize
+        LogController controller;
+        controller.load_boot_options(cache);
+        EXPECT_EQ(controller.logsize, c.mb) << c.value;
+    }
+    EXPECT_TRUE(history_has("logsize 0 is not a size in MB, 300 used"));
 }
 
 TEST(ComposeRunFolder, NamesTheFolderAfterTheStartTime) {
