@@ -10,7 +10,9 @@
 // errno ELOOP or ENOTDIR. "." and ".." below the root are refused (EINVAL).
 //
 // Modes are set through the descriptor (fchmod) on creation, so they do not
-// depend on the umask. Every descriptor is O_CLOEXEC. Functions return a
+// depend on the umask. Every descriptor is O_CLOEXEC. A folder the daemon may
+// search but not read is opened with O_PATH: good for the *at calls below,
+// not for listing it or syncing it. Functions return a
 // descriptor or 0, and -1 with errno set on failure.
 #pragma once
 
