@@ -255,6 +255,9 @@ static const char* config_fault(const char* key, const char* value) {
     // A line feed would add a line of its own to the configuration file;
     // other bytes (a trailing "\r", a tab) are stored as they come.
     if (strchr(key, '\n') != nullptr || strchr(value, '\n') != nullptr) return "line feed";
+    // Stored empty, a value reads back from the file as a lone line feed,
+    // which the next rewrite turns into a line of its own.
+    if (value[0] == '\0') return "empty value";
     // Items hold at most CONFIG_FIELD_LEN - 1 characters and a stored line
     // "key=value\n" at most 99: a longer value would be stored cut.
     size_t key_len = strlen(key), value_len = strlen(value);

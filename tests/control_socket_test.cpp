@@ -109,6 +109,7 @@ TEST_F(ControlSocketTest, ConfigurationMessages) {
          "logpath", "internal_sd", nullptr},
         {std::string("logpath=/mnt/sdcard2/logs\0", 26), "logpath=/mnt/sdcard2/logs", true, "logpath",
          "/mnt/sdcard2/logs", nullptr},
+        {std::string("logsize=\0", 9), "logsize=", false, "logsize", "300", "logsize= is not a valid configure (empty value)"},
         {std::string("colour=blue\0", 12), "colour=blue", true, "logsize", "300", "update item colour=blue to cache failed"},
     };
     for (const auto& c : cases) {
