@@ -11,7 +11,6 @@
 #include <stdlib.h>
 #include <string.h>
 #include <sys/socket.h>
-#include <time.h>
 #include <unistd.h>
 
 #include <random>
@@ -22,6 +21,7 @@
 #include "config/log_path.h"
 #include "core/control_socket.h"
 #include "core/log_controller.h"
+#include "fuzz/fuzz_util.h"
 
 namespace {
 
@@ -34,19 +34,9 @@ unsigned long seed = 0x7a7102, iteration = 0;
 
 size_t pick(size_t n) { return static_cast<size_t>(rng() % n); }
 
-std::string shown(const std::string& s) {
-    std::string out;
-    for (unsigned char c : s) {
-        char hex[8];
-        snprintf(hex, sizeof(hex), c >= 0x20 && c < 0x7f && c != '\\' ? "%c" : "\\x%02x", c);
-        out += hex;
-    }
-    return out;
-}
-
 [[noreturn]] void fail(const char* what, const std::string& input, const std::string& detail) {
     fprintf(stderr, "control_message_fuzz: FAILED at iteration %lu (seed %lu): %s\ninput: \"%s\"\n%s\n",
-            iteration, seed, what, shown(input).c_str(), shown(detail).c_str());
+            iteration, seed, what, fuzz_printable(input).c_str(), fuzz_printable(detail).c_str());
     abort();
 }
 
@@ -114,25 +104,11 @@ std::string read_all(const char* path) {
     return out;
 }
 
-double now() {
-    timespec ts;
-    clock_gettime(CLOCK_MONOTONIC, &ts);
-    return static_cast<double>(ts.tv_sec) + static_cast<double>(ts.tv_nsec) / 1e9;
-}
-
 }  // namespace
 
 int main(int argc, char** argv) {
-    if (access("/dev/emu/properties", F_OK) != 0) {
-        fprintf(stderr, "control_message_fuzz: run it inside the emulated phone (tools/tavlo-emu sandbox)\n");
-        return 2;
-    }
-    const char* env_seconds = getenv("TAVLO_FUZZ_SECONDS");
-    const char* env_seed = getenv("TAVLO_FUZZ_SEED");
-    double seconds = argc > 1 ? atof(argv[1]) : env_seconds ? atof(env_seconds) : 10.0;
-    if (argc > 2 || env_seed) seed = strtoul(argc > 2 ? argv[2] : env_seed, nullptr, 0);
-    printf("control_message_fuzz: seed %lu, %.1f s\n", seed, seconds);
-    fflush(stdout);
+    double seconds = 10.0;
+    fuzz_start("control_message_fuzz", argc, argv, &seconds, &seed);
     rng.seed(seed);
 
     LogController* controller = new LogController();
@@ -145,7 +121,7 @@ int main(int argc, char** argv) {
     int pair[2];
     if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair) != 0) return 2;
 
-    for (double deadline = now() + seconds; now() < deadline; iteration++) {
+    for (double deadline = fuzz_now() + seconds; fuzz_now() < deadline; iteration++) {
         std::string sent = message();
         if (sent.empty()) continue;
         std::string text = sent.substr(0, sent.size() - 1);

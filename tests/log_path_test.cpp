@@ -59,15 +59,6 @@ TEST_F(LogPathTest, ValueBecomesADirectory) {
     }
 }
 
-TEST_F(LogPathTest, OverlongValueIsRefusedInsideTheBuffer) {
-    std::string value = "/" + std::string(300, 'd');
-    char out[CONFIG_FIELD_LEN + 8];
-    memset(out, 'X', sizeof(out));
-    resolve_log_path(value.c_str(), out);
-    EXPECT_STREQ(out, "/mnt/sdcard");
-    for (size_t i = strlen(out) + 1; i < sizeof(out); i++) EXPECT_EQ(out[i], 'X') << "overrun at " << i;
-}
-
 TEST_F(LogPathTest, OverrideRewritesTheFileAndStaysAfterItIsCleared) {
     ASSERT_EQ(property_set(kOverride, "/data"), 0);  // also when the file is recreated
     load_logpath();
