@@ -89,7 +89,11 @@ int flush_one_queue(TransistQueue* q, bool notify) {
                 return FLUSH_FOLDER_LOST;
             }
             LogBuffer* node = list->head;
-            if (!room_for_node(&budget, entry->name, node->len)) {
+            // The same root as the check at the start of a cycle; the
+            // controller resets it only after the writer has ended.
+            const char* root = transist_controller ? transist_controller->current_log_root() : entry->name;
+            if (!room_for_node(&budget, root, node->len)) {
+                HLOG(TAG_UTIL, WLOG_ERROR, "%s is almost full or unavailable!!", root);
                 HLOG(TAG_TRANSIST, WLOG_ERROR, "no space to write log");
                 if (notify) {
                     reply_client(transist_controller, -1, "storage_full");
@@ -132,7 +136,7 @@ static int finish_at_stop() {
     pthread_mutex_lock(&file_table_lock);
     // Oldest first: the spare queue was drained a cycle before the drain
     // queue, which was filled before the fill queue. The flush keeps the
-    // reserve of the files' own file system.
+    // reserve of the run's log root.
     pthread_mutex_lock(&queue_lock);
     TransistQueue* order[QUEUE_COUNT] = {spare_queue, drain_queue, fill_queue};
     pthread_mutex_unlock(&queue_lock);
