@@ -41,7 +41,8 @@ int history_mode_set = 0;
 // Guarded by history_lock.
 char run_folder_root[PATH_LEN];
 // True while this thread holds history_lock: a record written from inside a
-// record (make_dir_recursive failing under the lock) must not take it again.
+// record (a refusal the safe file helpers record under the lock) must not
+// take it again.
 thread_local bool holding_history_lock = false;
 
 // The C library's local-time conversion takes a process-wide lock that a fork
