@@ -111,8 +111,8 @@ int main(int argc, char** argv) {
     fuzz_start("control_message_fuzz", argc, argv, &seconds, &seed);
     rng.seed(seed);
 
-    LogController* controller = new LogController();
-    controller->boot_mode = 1;  // no exception-engine tool
+    LogController controller;
+    controller.boot_mode = 1;  // no exception-engine tool
     ConfigCache cache;
     config_init(&cache);
     config_write(&cache);
@@ -129,7 +129,7 @@ int main(int argc, char** argv) {
         int command = match_control_command(upto_nul.c_str());
         if (command != CONTROL_CONFIG && command != CONTROL_STOP && command != CONTROL_DEEP_STOP) continue;
         if (write(pair[1], sent.data(), sent.size()) != static_cast<ssize_t>(sent.size())) return 2;
-        if (handle_client_message(controller, pair[0]) != 1) fail("client dropped", sent, "");
+        if (handle_client_message(&controller, pair[0]) != 1) fail("client dropped", sent, "");
         char reply[CONTROL_REPLY_MAX + 64];
         ssize_t n = recv(pair[1], reply, sizeof(reply), MSG_DONTWAIT);
         std::string got = n > 0 ? std::string(reply, static_cast<size_t>(n)) : "";

@@ -317,7 +317,8 @@ uint64_t small_card_free(const char*) {
 // One cycle carrying 8 MB must stop at the 10 MiB reserve, not after it.
 TEST_F(TransistTest, ReserveHoldsWhileACycleWrites) {
     writer_free_space = small_card_free;
-    rotate_limit_kb = 1 << 20;  // one file holds it all
+    transist_controller = controller_;  // as a run's start sets it
+    rotate_limit_kb = 1 << 20;          // one file holds it all
     open_output_files(controller_, kRun);
     TransistQueue q = {};
     std::string chunk(CHUNK_MAX, 'k');
