@@ -48,6 +48,18 @@ static char letter_for(const char* name) {
 
 LogCat::LogCat(const char* name) : CollectorLink(KIND_ANDROID, letter_for(name)) {}
 
+LogCat::~LogCat() {
+    while (LogDevice* d = devices) {
+        while (QueuedEntry* e = dequeue_oldest(d)) free_queued_entry(e);
+        if (d->fd >= 0) close(d->fd);
+        free(d->device);
+        devices = d->next;
+        delete d;
+    }
+    if (format != nullptr) android_log_format_free(format);
+    if (event_tag_map != nullptr) android_closeEventTagMap(event_tag_map);
+}
+
 LogDevice* LogCat::add_device(const char* path, bool binary, uint32_t log_id, int fd) {
     LogDevice* device = new (std::nothrow) LogDevice();
     char* copy = strdup(path);

@@ -20,7 +20,9 @@ class LogCat : public CollectorLink {
     // name is the collector name ("main_log", "radio_log", "events_log"),
     // which gives the stream letter.
     explicit LogCat(const char* name);
-    ~LogCat() override {}
+    // The collector process ends without destroying it; tests and the
+    // benchmark, which run the engine in place, release what it holds.
+    ~LogCat() override;
 
     // Runs in the collector child: device null for main (with system when
     // present), else "radio" or "events". Never returns.
