@@ -168,8 +168,13 @@ void LogCat::print_next_entry(LogDevice* device) {
     } else {
         rc = android_log_processLogBuffer(&entry->entry, &line);
     }
+    // The priority is the entry's own byte, any value at all: read it as the
+    // number it is, not as one of the enumerated priorities.
+    int priority;
+    memcpy(&priority, &line.priority, sizeof(priority));
     // An entry that cannot be decoded is dropped without a word.
-    if (rc == 0 && android_log_shouldPrintLine(format, line.tag, line.priority)) format_and_send(line);
+    if (rc == 0 && android_log_shouldPrintLine(format, line.tag, static_cast<android_LogPriority>(priority)))
+        format_and_send(line);
     drop_next_entry(device);
 }
 

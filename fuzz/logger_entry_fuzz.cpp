@@ -57,14 +57,16 @@ std::string make_entry(uint32_t arrival, bool* wild) {
     *wild = pick(6) == 0 || s.size() < LEGACY_HEADER_SIZE;
     if (s.size() < LEGACY_HEADER_SIZE) return s;
     size_t len = s.size() - LEGACY_HEADER_SIZE;
-    if (pick(5) != 0) len -= pick(len + 1) / (pick(4) + 1);  // stated length within the bytes read
+    if (pick(5) == 0) len -= pick(len + 1);  // a stated length below what was read,
+    if (pick(7) == 0) len += 1 + pick(200);  // or beyond it
     s[0] = static_cast<char>(len);
     s[1] = static_cast<char>(len >> 8);
     if (*wild) return s;
     put32(s, 4, arrival);
     put32(s, 12, 1000 + static_cast<uint32_t>(pick(60)));
     put32(s, 16, static_cast<uint32_t>(pick(3)) * 250000000u);
-    if (len >= 2 && pick(2)) s[LEGACY_HEADER_SIZE + 1 + pick(len - 1)] = '\0';  // a tag end
+    size_t read_len = s.size() - LEGACY_HEADER_SIZE;
+    if (len >= 2 && len <= read_len && pick(2)) s[LEGACY_HEADER_SIZE + 1 + pick(len - 1)] = '\0';  // a tag end
     return s;
 }
 
