@@ -60,7 +60,7 @@ LogCat::~LogCat() {
     if (event_tag_map != nullptr) android_closeEventTagMap(event_tag_map);
 }
 
-LogDevice* LogCat::add_device(const char* path, bool binary, uint32_t log_id, int fd) {
+LogDevice* LogCat::add_device(const char* path, bool binary, log_id_t log_id, int fd) {
     LogDevice* device = new (std::nothrow) LogDevice();
     char* copy = strdup(path);
     if (device == nullptr || copy == nullptr) {
@@ -110,6 +110,30 @@ int LogCat::take_entry(LogDevice* device, const char* raw, size_t n) {
     return 1;
 }
 
+void LogCat::flush_output() {
+    if (output_len == 0) return;
+    int rc = send_to_transist(output, output_len, transist_fd);
+    output_len = 0;
+    if (rc < 0) {
+        HLOG(TAG_ANDROID, WLOG_ERROR, "output error");
+        exit_collector(this, 1, REASON_OUTPUT);
+    }
+}
+
+void LogCat::append_output(const char* text, size_t len) {
+    if (output_len + len > sizeof(output)) flush_output();
+    if (len > sizeof(output)) {
+        int rc = send_to_transist(text, len, transist_fd);
+        if (rc < 0) {
+            HLOG(TAG_ANDROID, WLOG_ERROR, "output error");
+            exit_collector(this, 1, REASON_OUTPUT);
+        }
+        return;
+    }
+    memcpy(output + output_len, text, len);
+    output_len += len;
+}
+
 void LogCat::print_start_marker(LogDevice* device) {
     if (device->printed) return;
     device->printed = true;
@@ -117,20 +141,19 @@ void LogCat::print_start_marker(LogDevice* device) {
     char line[1024];
     int n = snprintf(line, sizeof(line), "--------- beginning of %s\n", device->device);
     if (n < 0) return;
-    size_t len = static_cast<size_t>(n) < sizeof(line) ? static_cast<size_t>(n) : sizeof(line) - 1;
-    send_to_transist(line, len, transist_fd);
+    append_output(line, static_cast<size_t>(n) < sizeof(line) ? static_cast<size_t>(n) : sizeof(line) - 1);
 }
 
 void LogCat::format_and_send(const AndroidLogEntry& line) {
     char buf[512];
     size_t len = 0;
     char* text = android_log_formatLogLine(format, buf, sizeof(buf), &line, &len);
-    int rc = text != nullptr ? send_to_transist(text, len, transist_fd) : -1;
-    if (text != nullptr && text != buf) free(text);
-    if (rc < 0) {
+    if (text == nullptr) {
         HLOG(TAG_ANDROID, WLOG_ERROR, "output error");
         exit_collector(this, 1, REASON_OUTPUT);
     }
+    append_output(text, len);
+    if (text != buf) free(text);
 }
 
 void LogCat::drop_next_entry(LogDevice* device) {
@@ -191,18 +214,21 @@ void LogCat::push_marker_entry(LogDevice* device) {
 void LogCat::print_ready() {
     for (;;) {
         LogDevice* first = choose_first_device(devices);
-        if (first == nullptr) return;
+        if (first == nullptr) break;
         if (holds_single_entry(first)) {
-            if (!overloaded) return;
+            if (!overloaded) break;
             // Too much held back: a marker behind the lone entry releases it.
             push_marker_entry(first);
         }
         print_next_entry(first);
     }
+    // What is rendered waits for a full batch or the quiet time, at most the
+    // 5 ms the merge holds entries anyway.
 }
 
 void LogCat::print_all() {
     for (LogDevice* first; (first = choose_first_device(devices)) != nullptr;) print_next_entry(first);
+    flush_output();
 }
 
 void LogCat::finish(int status, int reason) {
@@ -300,12 +326,12 @@ void LogCat::run(const char*, const char* device, int block_fd) {
     if (device != nullptr) {
         snprintf(path, sizeof(path), "%s%s", device_root, device);
         bool events = strcmp(device, "events") == 0;
-        add_device(path, events, events ? LOGGER_EVENTS : LOGGER_RADIO, -1);
+        add_device(path, events, events ? LOG_ID_EVENTS : LOG_ID_RADIO, -1);
     } else {
         snprintf(path, sizeof(path), "%smain", device_root);
-        add_device(path, false, LOGGER_MAIN, -1);
+        add_device(path, false, LOG_ID_MAIN, -1);
         snprintf(path, sizeof(path), "%ssystem", device_root);
-        if (access(path, F_OK) == 0) add_device(path, false, LOGGER_SYSTEM, -1);
+        if (access(path, F_OK) == 0) add_device(path, false, LOG_ID_SYSTEM, -1);
     }
 
     if (!set_output_format()) {

@@ -35,7 +35,7 @@ class LogCat : public CollectorLink {
 
     // Appends a device to the list (path copied). Returns it, or null when
     // memory is short.
-    LogDevice* add_device(const char* path, bool binary, uint32_t log_id, int fd);
+    LogDevice* add_device(const char* path, bool binary, log_id_t log_id, int fd);
     // Selects "threadtime"; 0 when the library does not know it.
     int set_output_format();
     // Queues one entry's bytes as read from device. Returns 1, or 0 when they
@@ -45,8 +45,11 @@ class LogCat : public CollectorLink {
     // an entry that is alone in its device's queue (an older one of another
     // device may still be unread) unless the collector is overloaded.
     void print_ready();
-    // Sends everything queued, oldest first.
+    // Sends everything queued, oldest first, and every rendered line.
     void print_all();
+    // Lines go out in batches of up to 4 KB, one send each: a stream costs a
+    // send per batch rather than per line. Sends the batch so far.
+    void flush_output();
     // The reading loop over the open devices; never returns.
     [[noreturn]] void read_log_lines();
 
@@ -62,6 +65,7 @@ class LogCat : public CollectorLink {
     void print_start_marker(LogDevice* device);
     void push_marker_entry(LogDevice* device);
     void format_and_send(const AndroidLogEntry& line);
+    void append_output(const char* text, size_t len);
     void queue(LogDevice* device, QueuedEntry* entry);
     // Reads one entry of device: 1 queued, 0 nothing now (EAGAIN or EINTR, in
     // *interrupted), never returns on a read failure or end of stream.
@@ -74,4 +78,6 @@ class LogCat : public CollectorLink {
     AndroidLogFormat* format = nullptr;
     char event_text[1024];  // decoded binary values
     char event_tag[64];     // an event's tag name from the tag map
+    char output[4096];      // rendered lines not sent yet
+    size_t output_len = 0;
 };

@@ -7,7 +7,7 @@
 struct LogDevice {
     char* device = nullptr;  // path, owned ("/dev/log/main", ...)
     bool binary = false;     // entries are binary events
-    uint32_t log_id = LOGGER_MAIN;
+    log_id_t log_id = LOG_ID_MAIN;
     int fd = -1;
     bool printed = false;           // its first entry was printed or dropped
     QueuedEntry* queue = nullptr;   // oldest entry, null when empty

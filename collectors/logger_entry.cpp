@@ -24,7 +24,7 @@ static void put_le32(char* p, uint32_t v) {
     for (int i = 0; i < 4; i++) p[i] = static_cast<char>((v >> (8 * i)) & 0xff);
 }
 
-QueuedEntry* adapt_legacy_entry(const char* raw, size_t n, uint32_t log_id) {
+QueuedEntry* adapt_legacy_entry(const char* raw, size_t n, log_id_t log_id) {
     if (n < LEGACY_HEADER_SIZE) return nullptr;
     size_t len = le16(raw);
     if (len > n - LEGACY_HEADER_SIZE) return nullptr;

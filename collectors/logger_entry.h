@@ -11,15 +11,13 @@
 #include <stddef.h>
 #include <stdint.h>
 
+#include <android/log.h>
 #include <log/log_read.h>
 
 // The legacy header, little-endian, as it lies at the start of each read.
 constexpr size_t LEGACY_HEADER_SIZE = 20;
 // One read from a logger device returns at most this many bytes.
 constexpr size_t LOGGER_READ_MAX = 5 * 1024;
-
-// Log ids the platform library knows the buffers by.
-enum LoggerId : uint32_t { LOGGER_MAIN = 0, LOGGER_RADIO = 1, LOGGER_EVENTS = 2, LOGGER_SYSTEM = 3 };
 
 struct QueuedEntry {
     QueuedEntry* prev;  // next older entry of the same device, or null
@@ -38,7 +36,7 @@ inline char* entry_payload(QueuedEntry* queued) {
 // a block sized to its payload. Returns null when the bytes are not a whole
 // entry (shorter than the header, or than the payload length it states) or
 // when memory is short; bytes beyond the stated length are ignored.
-QueuedEntry* adapt_legacy_entry(const char* raw, size_t n, uint32_t log_id);
+QueuedEntry* adapt_legacy_entry(const char* raw, size_t n, log_id_t log_id);
 
 void free_queued_entry(QueuedEntry* queued);
 

@@ -101,9 +101,9 @@ int main(int argc, char** argv) {
     LogCat cat("main_log");
     cat.transist_fd = open("/dev/null", O_WRONLY | O_CLOEXEC);
     if (cat.transist_fd < 0 || !cat.set_output_format()) return 2;
-    LogDevice* devices[] = {cat.add_device("/dev/log/main", false, LOGGER_MAIN, -1),
-                            cat.add_device("/dev/log/system", false, LOGGER_SYSTEM, -1),
-                            cat.add_device("/dev/log/events", true, LOGGER_EVENTS, -1)};
+    LogDevice* devices[] = {cat.add_device("/dev/log/main", false, LOG_ID_MAIN, -1),
+                            cat.add_device("/dev/log/system", false, LOG_ID_SYSTEM, -1),
+                            cat.add_device("/dev/log/events", true, LOG_ID_EVENTS, -1)};
     bool wild_queued = false;
     unsigned long i = 0;
     for (double deadline = now_s() + seconds; now_s() < deadline; i++) {

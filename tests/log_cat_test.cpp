@@ -40,7 +40,7 @@ struct Engine {
         cat.transist_fd = open(kOut, O_RDWR | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
         EXPECT_EQ(cat.set_output_format(), 1);
         for (const char* d = devices; *d; d++)
-            cat.add_device(*d == 'M' ? "/dev/log/main" : "/dev/log/system", false, LOGGER_MAIN, -1);
+            cat.add_device(*d == 'M' ? "/dev/log/main" : "/dev/log/system", false, LOG_ID_MAIN, -1);
     }
     ~Engine() { close(cat.transist_fd); }
     LogDevice* device(int index) {
@@ -79,6 +79,7 @@ TEST(LogCatMerge, SendsInTimeOrderAndHoldsALoneEntryUntilItIsSafe) {
         for (const std::string& step : c.steps) {
             if (step == "data" || step == "pause") {
                 step == "data" ? engine.cat.print_ready() : engine.cat.print_all();
+                engine.cat.flush_output();
                 std::string sent = engine.sent();
                 got += tokens(sent.substr(seen)) + "/ ";
                 seen = sent.size();
@@ -107,6 +108,7 @@ TEST(LogCatMerge, OverloadReleasesTheHeldEntryWithAMarker) {
         raw = entry(2000 + i, "s" + std::to_string(i));
         engine.cat.take_entry(engine.device(1), raw.data(), raw.size());
         engine.cat.print_ready();
+        engine.cat.flush_output();
         if (i < 9999) expect += "s" + std::to_string(i) + " ";
         if (i == 9997) {
             EXPECT_EQ(engine.sent(), "") << "held before the overload";
@@ -121,7 +123,7 @@ TEST(LogCatMerge, OverloadReleasesTheHeldEntryWithAMarker) {
 TEST(LogCatMerge, EventsAreNamedFromTheTagMap) {
     write_file("/tmp/event-log-tags", "12345 tavlo_demo (count|1),(name|3)\n");
     Engine engine("", "events_log");
-    LogDevice* events = engine.cat.add_device("/dev/log/events", true, LOGGER_EVENTS, -1);
+    LogDevice* events = engine.cat.add_device("/dev/log/events", true, LOG_ID_EVENTS, -1);
     engine.cat.event_tag_map = android_openEventTagMap("/tmp/event-log-tags");
     // Tag 12345, then a list of an int 7 and the string "abc".
     const char payload[] = "\x39\x30\0\0\x03\x02\0\x07\0\0\0\x02\x03\0\0\0abc";
@@ -163,8 +165,8 @@ TEST(LogCatEnds, SendsWhatItReadBeforeItEnds) {
             engine.cat.shm_fd = run.fd;
             install_stop_signal(&engine.cat);
             if (!attach_control_block(&engine.cat)) _exit(99);
-            engine.cat.add_device("/dev/log/main", false, LOGGER_MAIN, main_pair[0]);
-            engine.cat.add_device("/dev/log/system", false, LOGGER_SYSTEM, system_pair[0]);
+            engine.cat.add_device("/dev/log/main", false, LOG_ID_MAIN, main_pair[0]);
+            engine.cat.add_device("/dev/log/system", false, LOG_ID_SYSTEM, system_pair[0]);
             if (c.signal) {  // pending until the loop waits
                 sigset_t usr1;
                 sigemptyset(&usr1);
