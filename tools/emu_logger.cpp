@@ -37,7 +37,7 @@ namespace {
 constexpr gid_t AID_LOG = 1007;
 constexpr fuse_ino_t INJECT_INO = 2 + LOGGER_BUFFER_COUNT;
 constexpr double CACHE_SECONDS = 3600;  // the tree never changes while mounted
-constexpr int MAX_READERS = 1024;        // bounds what openers can make us hold
+constexpr int MAX_READERS = 16384;       // bounds what openers can make us hold (48 bytes each)
 
 // One open for reading; the descriptor's file handle points at it.
 struct Reader {
@@ -89,11 +89,20 @@ bool attr_of(fuse_ino_t ino, struct stat* st) {
     return true;
 }
 
-// The writer's process id: the request carries its thread id.
-int32_t tgid_of(pid_t tid) {
-    char path[32];
-    snprintf(path, sizeof(path), "/proc/%d/status", static_cast<int>(tid));
-    UniqueFd fd(RETRY_EINTR(open(path, O_RDONLY | O_CLOEXEC)));
+// A writer's process id: the request carries its thread id. Reading
+// /proc/TID/status costs more than the rest of a write, so recent writers are
+// remembered with a handle on their /proc folder: it tells whether that very
+// thread still lives, so a reused thread id is never taken for the old one.
+struct KnownWriter {
+    pid_t tid = 0;
+    int32_t tgid = 0;
+    int dir = -1;
+};
+KnownWriter g_writers[16];
+unsigned g_next_writer = 0;
+
+int32_t tgid_in(int dir, pid_t tid) {
+    UniqueFd fd(RETRY_EINTR(openat(dir, "status", O_RDONLY | O_CLOEXEC)));
     char text[512];
     ssize_t n = fd.ok() ? RETRY_EINTR(read(fd.get(), text, sizeof(text) - 1)) : -1;
     if (n <= 0) return tid;
@@ -102,7 +111,32 @@ int32_t tgid_of(pid_t tid) {
     return at != nullptr ? static_cast<int32_t>(atoi(at + 6)) : tid;
 }
 
-// Sends the reader's next entry; 0 when there is none.
+int32_t pid_of_writer(pid_t tid) {
+    for (KnownWriter& w : g_writers) {
+        if (w.tid != tid) continue;
+        if (faccessat(w.dir, "status", F_OK, 0) == 0) return w.tgid;
+        close(w.dir);
+        w = KnownWriter();
+        break;
+    }
+    char path[32];
+    snprintf(path, sizeof(path), "/proc/%d", static_cast<int>(tid));
+    int dir = RETRY_EINTR(open(path, O_PATH | O_DIRECTORY | O_CLOEXEC));
+    if (dir < 0) return tid;
+    KnownWriter& slot = g_writers[g_next_writer++ % 16];
+    if (slot.dir >= 0) close(slot.dir);
+    slot.tid = tid;
+    slot.tgid = tgid_in(dir, tid);
+    slot.dir = dir;
+    return slot.tgid;
+}
+
+Reader* reader_of(const struct fuse_file_info* fi) {
+    return reinterpret_cast<Reader*>(static_cast<uintptr_t>(fi->fh));
+}
+
+// Answers the read with the reader's next entry (or EINVAL when it does not
+// fit); false, with nothing sent, when the reader has read everything.
 bool reply_entry(fuse_req_t req, Reader* reader, size_t size) {
     const LoggerRing& ring = *g_present[reader->buffer];
     reader->pos = ring.clamp(reader->pos);
@@ -232,7 +266,7 @@ void op_open(fuse_req_t req, fuse_ino_t ino, struct fuse_file_info* fi) {
         reader->pos = g_present[buffer]->oldest();
         reader->next = g_readers[buffer];
         g_readers[buffer] = reader;
-        fi->fh = reinterpret_cast<uint64_t>(reader);
+        fi->fh = static_cast<uint64_t>(reinterpret_cast<uintptr_t>(reader));
     }
     if (fuse_reply_open(req, fi) != 0 && fi->fh != 0) {
         // The opener is gone (interrupted): no release will come.
@@ -244,7 +278,7 @@ void op_open(fuse_req_t req, fuse_ino_t ino, struct fuse_file_info* fi) {
 }
 
 void op_release(fuse_req_t req, fuse_ino_t, struct fuse_file_info* fi) {
-    Reader* reader = reinterpret_cast<Reader*>(fi->fh);
+    Reader* reader = reader_of(fi);
     if (reader != nullptr) {
         for (Reader** p = &g_readers[reader->buffer]; *p != nullptr; p = &(*p)->next) {
             if (*p == reader) {
@@ -260,7 +294,7 @@ void op_release(fuse_req_t req, fuse_ino_t, struct fuse_file_info* fi) {
 }
 
 void op_read(fuse_req_t req, fuse_ino_t, size_t size, off_t, struct fuse_file_info* fi) {
-    Reader* reader = reinterpret_cast<Reader*>(fi->fh);
+    Reader* reader = reader_of(fi);
     if (reader == nullptr) {
         fuse_reply_err(req, EBADF);
         return;
@@ -292,7 +326,7 @@ void op_write(fuse_req_t req, fuse_ino_t ino, const char* buf, size_t size, off_
     if (buffer >= 0) {
         // pid 0: a writer outside the phone (the host through its root).
         int32_t tid = ctx->pid;
-        int32_t pid = tid > 0 ? tgid_of(tid) : 0;
+        int32_t pid = tid > 0 ? pid_of_writer(tid) : 0;
         struct timespec now;
         clock_gettime(CLOCK_REALTIME, &now);
         size_t kept = logger_device_write(g_present[buffer], pid, tid, now, buf, size);
@@ -315,7 +349,7 @@ void op_write(fuse_req_t req, fuse_ino_t ino, const char* buf, size_t size, off_
 }
 
 void op_poll(fuse_req_t req, fuse_ino_t, struct fuse_file_info* fi, struct fuse_pollhandle* ph) {
-    Reader* reader = reinterpret_cast<Reader*>(fi->fh);
+    Reader* reader = reader_of(fi);
     unsigned revents = POLLOUT | POLLWRNORM;
     if (reader != nullptr) {
         const LoggerRing& ring = *g_present[reader->buffer];
@@ -405,6 +439,15 @@ int main(int argc, char** argv) {
         }
         close(ready[0]);
         setsid();
+        // Whoever started us may wait for the end of our output: keep none
+        // of it; errors go to the phone's console when there is one.
+        int null_fd = open("/dev/null", O_RDWR | O_CLOEXEC);
+        int console = open("/dev/emu/console.log", O_WRONLY | O_APPEND | O_CLOEXEC | O_NOFOLLOW);
+        dup2(null_fd, 0);
+        dup2(null_fd, 1);
+        dup2(console >= 0 ? console : null_fd, 2);
+        if (console >= 0) close(console);
+        if (null_fd >= 0) close(null_fd);
     }
 
     struct fuse_lowlevel_ops ops;

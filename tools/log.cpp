@@ -87,7 +87,7 @@ int main(int argc, char** argv) {
 
     if (strcmp(buffer, "events") == 0) {
         char* end = nullptr;
-        long number = tag != nullptr ? strtol(tag, &end, 10) : -1;
+        long long number = tag != nullptr ? strtoll(tag, &end, 10) : -1;
         if (end == tag || end == nullptr || *end != '\0' || number < 0 || number > INT32_MAX || optind == argc)
             return usage();
         uint8_t payload[LOGGER_MAX_PAYLOAD];
