@@ -2,10 +2,8 @@
 // phone's writers put into the logger devices, the kernel log and the
 // Bluetooth log service lands once in its file, as threadtime lines in time
 // order for the Android logs, and the stop takes everything written before it.
-#include <fcntl.h>
 #include <stdio.h>
 #include <string.h>
-#include <unistd.h>
 
 #include <sstream>
 #include <string>
@@ -53,10 +51,7 @@ TEST(AllCollectors, EveryEntryLandsOnceInItsFileAndTheStopTakesThemAll) {
     // Kernel and Bluetooth bytes pass through relays of the phone: wait for them.
     std::string bt;
     for (int i = 0; i < 600; i++) bt.push_back(static_cast<char>(i % 256));
-    int feed = open((phone.image_dir() + "/.emu/btlog").c_str(), O_WRONLY | O_CLOEXEC);
-    ASSERT_GE(feed, 0);
-    ASSERT_EQ(write(feed, bt.data(), bt.size()), 600);
-    close(feed);
+    ASSERT_TRUE(phone.write_btlog(bt));
     ASSERT_TRUE(phone.write_kmsg("<6>kernel line\n"));
     EXPECT_TRUE(EmuPhone::wait_for([&] {
         return phone.read_file(folder + "bt_log").size() > bt.size() &&
