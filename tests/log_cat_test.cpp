@@ -6,8 +6,6 @@
 
 #include <sstream>
 
-#include <log/event_tag_map.h>
-
 #include "test_util.h"
 
 namespace {
@@ -36,7 +34,7 @@ std::string tokens(const std::string& text) {
 
 // A collector's engine writing into a file, devices "M" (main) and "S" (system).
 struct Engine {
-    explicit Engine(const char* devices, const char* name = "main_log") : cat(name) {
+    explicit Engine(const char* devices) : cat("main_log") {
         cat.transist_fd = open(kOut, O_RDWR | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
         EXPECT_EQ(cat.set_output_format(), 1);
         for (const char* d = devices; *d; d++)
@@ -118,21 +116,6 @@ TEST(LogCatMerge, OverloadReleasesTheHeldEntryWithAMarker) {
     engine.cat.print_all();
     EXPECT_NE(lines_of(kOut).back().find("    0     0 W ORU     : trigger log"), std::string::npos)
         << lines_of(kOut).back();
-}
-
-TEST(LogCatMerge, EventsAreNamedFromTheTagMap) {
-    write_file("/tmp/event-log-tags", "12345 tavlo_demo (count|1),(name|3)\n");
-    Engine engine("", "events_log");
-    LogDevice* events = engine.cat.add_device("/dev/log/events", true, LOG_ID_EVENTS, -1);
-    engine.cat.event_tag_map = android_openEventTagMap("/tmp/event-log-tags");
-    // Tag 12345, then a list of an int 7 and the string "abc".
-    const char payload[] = "\x39\x30\0\0\x03\x02\0\x07\0\0\0\x02\x03\0\0\0abc";
-    std::string raw = entry(1000, "");
-    raw.replace(LEGACY_HEADER_SIZE, std::string::npos, payload, sizeof(payload) - 1);
-    raw[0] = sizeof(payload) - 1;
-    ASSERT_EQ(engine.cat.take_entry(events, raw.data(), raw.size()), 1);
-    engine.cat.print_all();
-    EXPECT_NE(engine.sent().find("  100   101 I tavlo_demo: [7,abc]\n"), std::string::npos) << engine.sent();
 }
 
 // The loop on two datagram socket pairs: whatever made it end, everything it
