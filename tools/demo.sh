@@ -1,6 +1,7 @@
 #!/usr/bin/env bash
 # The main job: build everything, boot an emulated phone with the daemon,
-# record a logging run of its kernel log, and show what was written.
+# record a logging run of its logs (Android logger buffers, kernel log,
+# Bluetooth stack log), and show what was written.
 set -eu
 cd "$(dirname "$0")/.."
 tools/install-deps.sh
@@ -17,9 +18,15 @@ $emu boot "$phone"
 
 echo "== Starting a logging run"
 $emu exec "$phone" tavlologctl start
+echo "== Writing logs on the phone"
+$emu exec "$phone" log -t demo hello
+$emu exec "$phone" log -b system -p w -t demo_sys "a line on the system buffer"
+$emu exec "$phone" log -b radio -t demo_radio "a line on the radio buffer"
+$emu exec "$phone" log -b events -t 1000003 i:3 s:demo
 for i in 1 2 3 4 5; do
     echo "<6>[demo] kernel line $i from the host" > "$phone/.emu/kmsg"
 done
+printf 'bluetooth stack log line from the host\n' > "$phone/.emu/btlog"
 sleep 2
 $emu exec "$phone" tavlologctl status
 echo "== Stopping the run"
@@ -36,7 +43,9 @@ if [ -n "$run" ]; then
     echo
     echo "== The run folder: $run"
     ls -l "$run"
-    echo
-    echo "== $run/kernel_log"
-    cat "$run/kernel_log"
+    for name in main_log radio_log events_log kernel_log bt_log; do
+        echo
+        echo "== $run/$name"
+        cat "$run/$name"
+    done
 fi
