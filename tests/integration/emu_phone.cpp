@@ -257,6 +257,10 @@ bool EmuPhone::boot(const BootOptions& options) {
         args.push_back("--data-size");
         args.push_back(std::to_string(options.data_mb));
     }
+    if (!options.ext_sdcard.empty()) {
+        args.push_back("--ext-sdcard");
+        args.push_back(options.ext_sdcard);
+    }
     booted_ = run_emu(args) == 0;
     return booted_;
 }
@@ -359,7 +363,8 @@ std::string EmuPhone::host_path(const std::string& device_path) const {
         const char* device;
         const char* image;
     } kMap[] = {{"/data", "/data"},         {"/system", "/system"}, {"/mnt/sdcard2", "/sdcard2"},
-                {"/mnt/sdcard", "/sdcard"}, {"/dev/emu", "/.emu"}};
+                {"/mnt/sdcard", "/sdcard"}, {"/dev/emu", "/.emu"},
+                {"/proc/last_kmsg", "/.emu/last_kmsg"}, {"/proc/last_kmsg2", "/.emu/last_kmsg2"}};
     for (const auto& m : kMap) {
         if (under(device_path, m.device))
             return dir_ + m.image + device_path.substr(strlen(m.device));
