@@ -19,6 +19,7 @@
 #include "common/control_protocol.h"
 #include "common/io_util.h"
 #include "common/wlog.h"
+#include "core/boot_copy.h"
 #include "core/child_supervision.h"
 #include "core/client_table.h"
 #include "core/log_controller.h"
@@ -27,8 +28,7 @@
 #include "storage/history_log.h"
 #include "storage/storage_check.h"
 
-// No boot log arrives on the card when no client shows up within this time.
-static constexpr time_t BOOT_COPY_TIMEOUT_S = 300;
+time_t boot_copy_timeout_s = BOOT_COPY_TIMEOUT_S;
 
 static void* control_thread(void* arg) {
     prctl(PR_SET_NAME, "tavlo.control", 0, 0, 0);
@@ -138,7 +138,7 @@ static unsigned long long read_counter(int fd) {
 void control_loop(LogController* controller) {
     // select() subtracts the time it waited, so the 300 seconds are spent over
     // every wait while the timer is armed, not restarted by each event.
-    struct timeval timeout = {BOOT_COPY_TIMEOUT_S, 0};
+    struct timeval timeout = {boot_copy_timeout_s, 0};
 
     for (;;) {
         fd_set readable;
@@ -173,6 +173,11 @@ void control_loop(LogController* controller) {
         if (ready == 0) {
             HLOG(TAG_MAIN, WLOG_ERROR, "select() timeout");
             controller->boot_copy_timer = 0;
+            if (boot_fail_copy(controller) < 0) {
+                HLOG(TAG_MAIN, WLOG_ERROR, "copy fail!");
+            } else {
+                HLOG(TAG_MAIN, WLOG_ERROR, "boot copy complete!");
+            }
             continue;
         }
         WLOG(TAG_MAIN, WLOG_DEBUG, "select() over,some fd can be read");
