@@ -108,6 +108,8 @@ FolderRecord* parse_folder_records(const char* text, size_t len) {
         if (space != nullptr) *space = '\0';
         if (line_len > LINE_MAX_CHARS || space == nullptr || !plain_name(line)) {
             if (space != nullptr) *space = ' ';
+            char* newline = strchr(line, '\n');
+            if (newline != nullptr) *newline = '\0';  // one record, one line
             HLOG(TAG_SIZE, WLOG_ERROR, "wrong format %s", line);
             continue;
         }

@@ -40,7 +40,7 @@ CopyResult copy_failed(LogController* controller, const char* src, int out, off_
     int err = errno;
     HLOG(TAG_MAIN, WLOG_ERROR, "file %s copy error! err:%s(%d)", src, strerror(err), err);
     warn_once(controller);
-    if (ftruncate(out, before) != 0) {
+    if (out >= 0 && ftruncate(out, before) != 0) {
         err = errno;
         HLOG(TAG_MAIN, WLOG_ERROR, "cannot take back the partial copy of %s(%s)", src, strerror(err));
     }
@@ -85,6 +85,22 @@ int collect_name(void* arg, const char* name, int) {
 }  // namespace
 
 CopyResult copy_log_file(LogController* controller, const char* src, const char* dst) {
+    // The source first: one that is there but cannot be read (a folder, a
+    // link) stays, and the destination is not touched for it.
+    char folder[PATH_LEN];
+    const char* slash = strrchr(src, '/');
+    size_t folder_len = slash != nullptr ? static_cast<size_t>(slash - src) + 1 : sizeof(folder);
+    UniqueFd dir, in;
+    if (folder_len < sizeof(folder)) {
+        memcpy(folder, src, folder_len);
+        folder[folder_len] = '\0';
+        dir.reset(safe_open_dir("/data", folder, false, 0));
+        if (dir.ok()) in.reset(safe_open_file(dir.get(), slash + 1, SAFE_READ, 0));
+    } else {
+        errno = ENAMETOOLONG;
+    }
+    if (!in.ok() && errno != ENOENT) return copy_failed(controller, src, -1, 0, false);
+
     UniqueFd out(safe_open_path_file(controller->logpath, dst, SAFE_APPEND, COPY_MODE));
     struct stat st;
     if (!out.ok() || fstat(out.get(), &st) != 0) {
@@ -97,39 +113,22 @@ CopyResult copy_log_file(LogController* controller, const char* src, const char*
     const char* note = data_storage_low ? kNoteLow : kNoteNormal;
     if (write_fully(out.get(), note, strlen(note)) != static_cast<ssize_t>(strlen(note)))
         return copy_failed(controller, src, out.get(), before, true);
-
-    char folder[PATH_LEN];
-    const char* slash = strrchr(src, '/');
-    size_t folder_len = slash != nullptr ? static_cast<size_t>(slash - src) + 1 : sizeof(folder);
-    if (folder_len >= sizeof(folder)) return copy_failed(controller, src, out.get(), before, false);
-    memcpy(folder, src, folder_len);
-    folder[folder_len] = '\0';
-    UniqueFd dir(safe_open_dir("/data", folder, false, 0));
-    UniqueFd in(dir.ok() ? safe_open_file(dir.get(), slash + 1, SAFE_READ, 0) : -1);
-    if (!in.ok()) {
-        // Nothing there: the note line alone tells that this piece is missing.
-        if (errno == ENOENT) {
-            WLOG(TAG_MAIN, WLOG_DEBUG, "copy '%s' done", src);
-            usleep(COPY_PAUSE_US);
-            return COPY_DONE;
+    if (in.ok()) {
+        char buf[COPY_BUF];
+        for (ssize_t n; (n = RETRY_EINTR(read(in.get(), buf, sizeof(buf)))) != 0;) {
+            if (n < 0) return copy_failed(controller, src, out.get(), before, false);
+            if (write_fully(out.get(), buf, static_cast<size_t>(n)) != n)
+                return copy_failed(controller, src, out.get(), before, true);
         }
-        return copy_failed(controller, src, out.get(), before, false);
+        // The source goes only once the copy is on storage: a power cut between
+        // the delete and the write-back would lose both.
+        if (RETRY_EINTR(fsync(out.get())) != 0) return copy_failed(controller, src, out.get(), before, true);
+        if (safe_remove_file(dir.get(), slash + 1) != 0) {
+            int err = errno;
+            HLOG(TAG_MAIN, WLOG_ERROR, "remove %s failed(%s)", src, strerror(err));
+        }
     }
-    char buf[COPY_BUF];
-    for (;;) {
-        ssize_t n = RETRY_EINTR(read(in.get(), buf, sizeof(buf)));
-        if (n == 0) break;
-        if (n < 0) return copy_failed(controller, src, out.get(), before, false);
-        if (write_fully(out.get(), buf, static_cast<size_t>(n)) != n)
-            return copy_failed(controller, src, out.get(), before, true);
-    }
-    // The source goes only once the copy is on storage: a power cut between the
-    // delete and the write-back would lose both.
-    if (RETRY_EINTR(fsync(out.get())) != 0) return copy_failed(controller, src, out.get(), before, true);
-    if (safe_remove_file(dir.get(), slash + 1) != 0) {
-        int err = errno;
-        HLOG(TAG_MAIN, WLOG_ERROR, "remove %s failed(%s)", src, strerror(err));
-    }
+    // A missing source leaves the note line alone, telling that its piece is missing.
     WLOG(TAG_MAIN, WLOG_DEBUG, "copy '%s' done", src);
     usleep(COPY_PAUSE_US);
     return COPY_DONE;

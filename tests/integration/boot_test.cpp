@@ -1,0 +1,149 @@
+// Recording from boot on the emulated phone: the boot-mode paths, the held
+// logs and their way onto the card, as scenarios of steps run by one driver.
+#include <string>
+#include <vector>
+
+#include <gtest/gtest.h>
+
+#include "tests/integration/log_daemon.h"
+
+namespace {
+
+// "boot" mode: reboot in that boot mode; "kmsg" text: feed the kernel log;
+// "ctl" command reply; "history" text: wait until recorded; "has" path text:
+// wait until the file holds text; "gone" path: wait until it is gone; "lacks"
+// path text. In paths $RUN is the run folder, $LAST the newest card folder.
+struct Step {
+    Step(const char* o, std::string x, std::string y = "") : op(o), a(std::move(x)), b(std::move(y)) {}
+    const char* op;
+    std::string a, b;
+};
+
+struct Scenario {
+    const char* name;
+    std::string defaults;  // /system/etc/qrvlog-config.prop
+    BootOptions options;
+    std::vector<Step> steps;
+};
+
+BootOptions mode(const char* boot_mode, int sdcard_mb = 0, int data_mb = 0, const char* ext_sdcard = "") {
+    BootOptions options;
+    options.boot_mode = boot_mode;
+    options.sdcard_mb = sdcard_mb;
+    options.data_mb = data_mb;
+    options.ext_sdcard = ext_sdcard;
+    return options;
+}
+
+void PrintTo(const Scenario& s, std::ostream* os) { *os << s.name; }
+
+const std::string N = "TavloLog in Normal\n";
+const std::string kOn = "com.quorvex.log.tavlo.enabled=true\n";
+const std::string kBig(3 << 20, 'x');
+
+std::string expand(EmuPhone& phone, const std::string& path) {
+    std::string folder;
+    if (path.compare(0, 5, "$LAST") == 0) {
+        phone.exec({"sh", "-c", "ls -d " + std::string(kCardRoot) + "*/ | tail -n 1"}, &folder);
+        folder = folder.empty() ? "/none/" : folder.substr(0, folder.size() - 1);
+    } else if (path.compare(0, 4, "$RUN") == 0) {
+        folder = run_folder(phone);
+        // The kelm boot's card is behind a link that the host cannot follow.
+        if (folder.compare(0, 22, "/data/ext_sdcard_tool/") == 0) folder = "/mnt/sdcard2/" + folder.substr(22);
+    } else {
+        return path;
+    }
+    return folder + path.substr(path.find('/') + 1);
+}
+
+class BootScenario : public ::testing::TestWithParam<Scenario> {};
+
+TEST_P(BootScenario, Runs) {
+    const Scenario& s = GetParam();
+    EmuPhone phone;
+    ASSERT_TRUE(s.defaults.empty() || phone.write_image_file("/system/etc/qrvlog-config.prop", s.defaults));
+    BootOptions options = s.options;
+    ASSERT_TRUE(phone.boot(options));
+    int boots = 1;
+    for (const Step& step : s.steps) {
+        std::string op = step.op, out;
+        SCOPED_TRACE(op + " " + step.a.substr(0, 60) + " " + step.b.substr(0, 60));
+        auto file_has = [&] { return contains(phone.read_file(expand(phone, step.a)), step.b); };
+        if (op == "boot") {
+            options.boot_mode = step.a;
+            ASSERT_TRUE(phone.stop() && phone.boot(options));
+            boots++;
+        } else if (op == "kmsg") {
+            ASSERT_TRUE(phone.write_kmsg(step.a + "\n"));
+        } else if (op == "ctl") {
+            // The boot path serves clients only once it is through.
+            phone.exec({"sh", "-c", "until grep -q @tavlologd /proc/net/unix; do sleep 0.05; done"}, nullptr, "", 40000);
+            ctl(phone, {step.a}, &out);
+            ASSERT_EQ(step.b + "\n", out);
+        } else if (op == "history") {
+            ASSERT_TRUE(wait_history(phone, step.a, 1, 330000)) << history(phone);
+        } else if (op == "has") {
+            ASSERT_TRUE(EmuPhone::wait_for(file_has, 20000)) << phone.read_file(expand(phone, step.a)).substr(0, 400);
+        } else if (op == "gone") {
+            ASSERT_TRUE(EmuPhone::wait_for([&] { return !phone.file_exists(expand(phone, step.a)); }, 20000));
+        } else {
+            ASSERT_FALSE(file_has());
+        }
+    }
+    EXPECT_EQ(boots, daemon_starts(phone)) << "the daemon ended during the test";
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Boot, BootScenario,
+    ::testing::Values(
+        Scenario{"CopyMovesTheRunAndTheHeldLogs", kOn, {},
+                 {{"kmsg", "held line"}, {"has", "/data/log_temp/kernel_log", "held line"}, {"ctl", "copy", "copy,1"},
+                  {"has", "$RUN/kernel_log.boot", N + kFileHeader + "held line\n"},
+                  {"has", "$RUN/properties", "<< /data/misc/tqlog/tqlog_config >>:\nautostart=1\n"},
+                  {"has", "$RUN/properties", "<< /data/misc/tqlog/tqlog_history >>:\n"},
+                  {"has", "$RUN/properties", "<< system properties >>\n"}, {"gone", "/data/log_temp"},
+                  {"has", "/data/misc/tqlog/inter_sd_folder", "APLog_"}}},
+        Scenario{"StartTakesTheHeldLogs", kOn, {},
+                 {{"kmsg", "held line"}, {"has", "/data/log_temp/kernel_log", "held line"}, {"ctl", "stop", "stop,1"},
+                  {"ctl", "start", "start,1"}, {"has", "$RUN/kernel_log.boot", "held line"}, {"gone", "/data/log_temp"}}},
+        Scenario{"DataPathRecordsOnData", kOn + "qrvlog_path=/data\n", {},
+                 {{"history", "mkdir /data/qrvlog/tavlolog/APLog_"}, {"history", " M("}, {"gone", "/data/log_temp"}}},
+        Scenario{"LowDataStartsNoRun", kOn, mode("0", 0, 8),
+                 {{"history", "/data is low, dont start children process(2)"}, {"ctl", "stop", "stop,1"},
+                  {"gone", "/data/log_temp"}, {"lacks", kHistory, " M("}}},
+        Scenario{"FastPowerOffLogsComeBackAsHbr", kOn, {},
+                 {{"ctl", "HBR_SHUTDOWN", "HBR_SHUTDOWN,1"}, {"kmsg", "hbr line"},
+                  {"has", "/data/log_hbr/kernel_log", "hbr line"}, {"boot", "0"}, {"kmsg", "second boot"},
+                  {"has", "/data/log_temp/kernel_log", "second boot"}, {"ctl", "stop", "stop,1"},
+                  {"ctl", "deep_start", "deep_start,1"}, {"has", "$RUN/kernel_log.hbr", N + kFileHeader + "hbr line\n"},
+                  {"has", "$RUN/kernel_log.boot", "second boot"}, {"gone", "/data/log_hbr"}, {"gone", "/data/log_temp"}}},
+        Scenario{"OtherBootsKeepTwoEarlierAndComeInOrder", kOn, mode("7"),
+                 {{"kmsg", "other 1"}, {"has", "/data/log_other_mode/1/kernel_log", "other 1"}, {"boot", "none"},
+                  {"boot", "7"}, {"boot", "9"}, {"boot", "7"}, {"kmsg", "other 5"},
+                  {"has", "/data/log_other_mode/5/kernel_log", "other 5"}, {"boot", "7"}, {"kmsg", "other 6"},
+                  {"has", "/data/log_other_mode/6/kernel_log", "other 6"}, {"history", "rm -r /data/log_other_mode/3"},
+                  {"gone", "/data/log_other_mode/3"}, {"boot", "0"}, {"ctl", "stop", "stop,1"}, {"ctl", "start", "start,1"},
+                  {"has", "$RUN/kernel_log.otherboot", "other 5\n" + N + kFileHeader + "other 6\n"},
+                  {"gone", "/data/log_other_mode"}}},
+        Scenario{"KelmBootCardAfterAPlainFolder", "", mode("1", 0, 0, "dir after 5 link"),
+                 {{"kmsg", "kelm line"}, {"has", "/data/log_temp/kernel_log", "kelm line"},
+                  {"history", "/data/ext_sdcard_tool is not a link, will delete it"},
+                  {"history", "SDcard mounted! kelm copy!"}, {"has", "$RUN/kernel_log.kelm_boot", N + kFileHeader + "kelm line\n"},
+                  {"ctl", "stop", "stop,1"}}},
+        Scenario{"KelmBootWithoutCardStops", "", mode("1"),
+                 {{"kmsg", "kelm line"}, {"history", "kelm wait sd timeout! stop!"}, {"history", "tavlolog stop done"},
+                  {"has", "/data/log_temp/kernel_log", "kelm line"}, {"ctl", "stop", "stop,1"}}},
+        // About five minutes: the boot copy waits that long for a client.
+        Scenario{"NoClientForFiveMinutesCopiesTheBootLogs", kOn, {},
+                 {{"kmsg", "boot line"}, {"history", "select() timeout"}, {"history", "boot copy complete!"},
+                  {"has", "$LAST/kernel_log.boot", "boot line"}, {"gone", "/data/log_temp"}}},
+        // The held log does not fit: its pieces stay in /data, nothing of them lands on the card.
+        Scenario{"FullCardKeepsTheHeldLogs", kOn, mode("0", 2),
+                 {{"kmsg", kBig + "end of held"}, {"has", "/data/log_temp/kernel_log", "end of held"},
+                  {"ctl", "copy", "copy,1"}, {"history", "copy error! err:No space left on device"},
+                  {"has", "/data/log_temp/kernel_log.1", kFileHeader + kBig.substr(0, 1000)},
+                  {"has", "/data/log_temp/kernel_log", "end of held"}, {"lacks", "$RUN/kernel_log.boot", "x"},
+                  {"ctl", "stop", "stop,1"}}}),
+    [](const ::testing::TestParamInfo<Scenario>& info) { return info.param.name; });
+
+}  // namespace
