@@ -14,14 +14,16 @@ namespace {
 // wait until the file holds text; "gone" path: wait until it is gone; "lacks"
 // path text. In paths $RUN is the run folder, $LAST the newest card folder.
 struct Step {
-    Step(const char* o, std::string x, std::string y = "") : op(o), a(std::move(x)), b(std::move(y)) {}
+    Step(const char* o, std::string x, std::string y = "", int wait = 40000)
+        : op(o), a(std::move(x)), b(std::move(y)), wait_ms(wait) {}
     const char* op;
     std::string a, b;
+    int wait_ms;
 };
 
 struct Scenario {
     const char* name;
-    std::string defaults;  // /system/etc/qrvlog-config.prop
+    std::vector<std::pair<std::string, std::string>> files;  // seeded into the image: path, content
     BootOptions options;
     std::vector<Step> steps;
 };
@@ -38,7 +40,7 @@ BootOptions mode(const char* boot_mode, int sdcard_mb = 0, int data_mb = 0, cons
 void PrintTo(const Scenario& s, std::ostream* os) { *os << s.name; }
 
 const std::string N = "TavloLog in Normal\n";
-const std::string kOn = "com.quorvex.log.tavlo.enabled=true\n";
+const std::pair<std::string, std::string> kOn = {"/system/etc/qrvlog-config.prop", "com.quorvex.log.tavlo.enabled=true\n"};
 const std::string kBig(3 << 20, 'x');
 
 std::string expand(EmuPhone& phone, const std::string& path) {
@@ -61,7 +63,7 @@ class BootScenario : public ::testing::TestWithParam<Scenario> {};
 TEST_P(BootScenario, Runs) {
     const Scenario& s = GetParam();
     EmuPhone phone;
-    ASSERT_TRUE(s.defaults.empty() || phone.write_image_file("/system/etc/qrvlog-config.prop", s.defaults));
+    for (const auto& f : s.files) ASSERT_TRUE(phone.write_image_file(f.first, f.second));
     BootOptions options = s.options;
     ASSERT_TRUE(phone.boot(options));
     int boots = 1;
@@ -81,11 +83,11 @@ TEST_P(BootScenario, Runs) {
             ctl(phone, {step.a}, &out);
             ASSERT_EQ(step.b + "\n", out);
         } else if (op == "history") {
-            ASSERT_TRUE(wait_history(phone, step.a, 1, 330000)) << history(phone);
+            ASSERT_TRUE(wait_history(phone, step.a, 1, step.wait_ms)) << history(phone);
         } else if (op == "has") {
-            ASSERT_TRUE(EmuPhone::wait_for(file_has, 20000)) << phone.read_file(expand(phone, step.a)).substr(0, 400);
+            ASSERT_TRUE(EmuPhone::wait_for(file_has, step.wait_ms)) << phone.read_file(expand(phone, step.a)).substr(0, 400);
         } else if (op == "gone") {
-            ASSERT_TRUE(EmuPhone::wait_for([&] { return !phone.file_exists(expand(phone, step.a)); }, 20000));
+            ASSERT_TRUE(EmuPhone::wait_for([&] { return !phone.file_exists(expand(phone, step.a)); }, step.wait_ms));
         } else {
             ASSERT_FALSE(file_has());
         }
@@ -96,28 +98,28 @@ TEST_P(BootScenario, Runs) {
 INSTANTIATE_TEST_SUITE_P(
     Boot, BootScenario,
     ::testing::Values(
-        Scenario{"CopyMovesTheRunAndTheHeldLogs", kOn, {},
+        Scenario{"CopyMovesTheRunAndTheHeldLogs", {kOn}, {},
                  {{"kmsg", "held line"}, {"has", "/data/log_temp/kernel_log", "held line"}, {"ctl", "copy", "copy,1"},
                   {"has", "$RUN/kernel_log.boot", N + kFileHeader + "held line\n"},
                   {"has", "$RUN/properties", "<< /data/misc/tqlog/tqlog_config >>:\nautostart=1\n"},
                   {"has", "$RUN/properties", "<< /data/misc/tqlog/tqlog_history >>:\n"},
                   {"has", "$RUN/properties", "<< system properties >>\n"}, {"gone", "/data/log_temp"},
                   {"has", "/data/misc/tqlog/inter_sd_folder", "APLog_"}}},
-        Scenario{"StartTakesTheHeldLogs", kOn, {},
+        Scenario{"StartTakesTheHeldLogs", {kOn}, {},
                  {{"kmsg", "held line"}, {"has", "/data/log_temp/kernel_log", "held line"}, {"ctl", "stop", "stop,1"},
                   {"ctl", "start", "start,1"}, {"has", "$RUN/kernel_log.boot", "held line"}, {"gone", "/data/log_temp"}}},
-        Scenario{"DataPathRecordsOnData", kOn + "qrvlog_path=/data\n", {},
+        Scenario{"DataPathRecordsOnData", {{kOn.first, kOn.second + "qrvlog_path=/data\n"}}, {},
                  {{"history", "mkdir /data/qrvlog/tavlolog/APLog_"}, {"history", " M("}, {"gone", "/data/log_temp"}}},
-        Scenario{"LowDataStartsNoRun", kOn, mode("0", 0, 8),
+        Scenario{"LowDataStartsNoRun", {kOn}, mode("0", 0, 8),
                  {{"history", "/data is low, dont start children process(2)"}, {"ctl", "stop", "stop,1"},
                   {"gone", "/data/log_temp"}, {"lacks", kHistory, " M("}}},
-        Scenario{"FastPowerOffLogsComeBackAsHbr", kOn, {},
+        Scenario{"FastPowerOffLogsComeBackAsHbr", {kOn}, {},
                  {{"ctl", "HBR_SHUTDOWN", "HBR_SHUTDOWN,1"}, {"kmsg", "hbr line"},
                   {"has", "/data/log_hbr/kernel_log", "hbr line"}, {"boot", "0"}, {"kmsg", "second boot"},
                   {"has", "/data/log_temp/kernel_log", "second boot"}, {"ctl", "stop", "stop,1"},
                   {"ctl", "deep_start", "deep_start,1"}, {"has", "$RUN/kernel_log.hbr", N + kFileHeader + "hbr line\n"},
                   {"has", "$RUN/kernel_log.boot", "second boot"}, {"gone", "/data/log_hbr"}, {"gone", "/data/log_temp"}}},
-        Scenario{"OtherBootsKeepTwoEarlierAndComeInOrder", kOn, mode("7"),
+        Scenario{"OtherBootsKeepTwoEarlierAndComeInOrder", {kOn}, mode("7"),
                  {{"kmsg", "other 1"}, {"has", "/data/log_other_mode/1/kernel_log", "other 1"}, {"boot", "none"},
                   {"boot", "7"}, {"boot", "9"}, {"boot", "7"}, {"kmsg", "other 5"},
                   {"has", "/data/log_other_mode/5/kernel_log", "other 5"}, {"boot", "7"}, {"kmsg", "other 6"},
@@ -125,20 +127,23 @@ INSTANTIATE_TEST_SUITE_P(
                   {"gone", "/data/log_other_mode/3"}, {"boot", "0"}, {"ctl", "stop", "stop,1"}, {"ctl", "start", "start,1"},
                   {"has", "$RUN/kernel_log.otherboot", "other 5\n" + N + kFileHeader + "other 6\n"},
                   {"gone", "/data/log_other_mode"}}},
-        Scenario{"KelmBootCardAfterAPlainFolder", "", mode("1", 0, 0, "dir after 5 link"),
+        // A restart would fail the same way: the daemon serves without a run instead.
+        Scenario{"OtherBootFolderThatCannotBeMadeLeavesNoRun", {kOn, {"/data/log_other_mode", "no folder"}}, mode("7"),
+                 {{"history", "mkdir /data/log_other_mode/1/ failed"}, {"ctl", "start", "start,1"}}},
+        Scenario{"KelmBootCardAfterAPlainFolder", {}, mode("1", 0, 0, "dir after 5 link"),
                  {{"kmsg", "kelm line"}, {"has", "/data/log_temp/kernel_log", "kelm line"},
                   {"history", "/data/ext_sdcard_tool is not a link, will delete it"},
                   {"history", "SDcard mounted! kelm copy!"}, {"has", "$RUN/kernel_log.kelm_boot", N + kFileHeader + "kelm line\n"},
                   {"ctl", "stop", "stop,1"}}},
-        Scenario{"KelmBootWithoutCardStops", "", mode("1"),
+        Scenario{"KelmBootWithoutCardStops", {}, mode("1"),
                  {{"kmsg", "kelm line"}, {"history", "kelm wait sd timeout! stop!"}, {"history", "tavlolog stop done"},
                   {"has", "/data/log_temp/kernel_log", "kelm line"}, {"ctl", "stop", "stop,1"}}},
         // About five minutes: the boot copy waits that long for a client.
-        Scenario{"NoClientForFiveMinutesCopiesTheBootLogs", kOn, {},
-                 {{"kmsg", "boot line"}, {"history", "select() timeout"}, {"history", "boot copy complete!"},
+        Scenario{"NoClientForFiveMinutesCopiesTheBootLogs", {kOn}, {},
+                 {{"kmsg", "boot line"}, {"history", "select() timeout", "", 320000}, {"history", "boot copy complete!"},
                   {"has", "$LAST/kernel_log.boot", "boot line"}, {"gone", "/data/log_temp"}}},
         // The held log does not fit: its pieces stay in /data, nothing of them lands on the card.
-        Scenario{"FullCardKeepsTheHeldLogs", kOn, mode("0", 2),
+        Scenario{"FullCardKeepsTheHeldLogs", {kOn}, mode("0", 2),
                  {{"kmsg", kBig + "end of held"}, {"has", "/data/log_temp/kernel_log", "end of held"},
                   {"ctl", "copy", "copy,1"}, {"history", "copy error! err:No space left on device"},
                   {"has", "/data/log_temp/kernel_log.1", kFileHeader + kBig.substr(0, 1000)},
