@@ -24,7 +24,7 @@ TEST(ParseDumpListText, OneEntryPerUsableLineLastLineFirst) {
     } cases[] = {
         {"/a out\n/b\n", {"/b>properties:F", "/a>out:F"}},
         {"#/c\n\n   \n  /x   y\tz sys_prop extra\n/p q SYS_PROP", {"/p>q:F", "/x>y\tz:P"}},
-        {std::string(255, 's') + " o\n" + std::string(254, 't') + "\n/ok", {"/ok>properties:F", std::string(254, 't') + ">properties:F"}},
+        {std::string(253, 's') + " o\n" + std::string(254, 't') + "\n/ok", {"/ok>properties:F", std::string(254, 't') + ">properties:F"}},
         {"/a ../up\n/b sub/x\n/c .\n", {}},
         {std::string("/a\0 hidden\n/b", 13), {"/b>properties:F", "/a>properties:F"}},
     };
