@@ -182,6 +182,7 @@ void control_loop(LogController* controller) {
         }
         WLOG(TAG_MAIN, WLOG_DEBUG, "select() over,some fd can be read");
         // Any activity means a client or a run is alive: the boot copy time-out is off for good.
+        bool boot_copy_armed = controller->boot_copy_timer != 0;
         controller->boot_copy_timer = 0;
 
         if (FD_ISSET(controller->listen_fd, &readable)) {
@@ -199,7 +200,15 @@ void control_loop(LogController* controller) {
         if (efd_chld > 0 && FD_ISSET(efd_chld, &readable)) {
             unsigned long long deaths = read_counter(efd_chld);
             HLOG(TAG_MAIN, WLOG_INFO, "recv efd_chld %llu", deaths);
+            pid_t before[] = {controller->mlog_pid, controller->rlog_pid, controller->elog_pid,
+                              controller->klog_pid, controller->blog_pid};
             check_children(controller);
+            pid_t after[] = {controller->mlog_pid, controller->rlog_pid, controller->elog_pid,
+                             controller->klog_pid, controller->blog_pid};
+            // The daemon's own shell commands ("oru -m 3" as the boot run starts)
+            // end too: only a collector's end tells that someone is there.
+            if (boot_copy_armed && ready == 1 && memcmp(before, after, sizeof(before)) == 0)
+                controller->boot_copy_timer = 1;
         }
         if (efd_thread > 0 && FD_ISSET(efd_thread, &readable)) {
             // 1001 storage low, 1002 log folder lost (or their sum): either way the run ends.
