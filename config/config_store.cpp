@@ -14,6 +14,7 @@
 #include "config/log_path.h"
 #include "platform/properties.h"
 #include "storage/history_log.h"
+#include "storage/safe_file.h"
 
 namespace {
 
@@ -23,9 +24,9 @@ constexpr size_t READ_PIECE_LEN = 1022;
 // config_parse_line looks at no more than this many characters of a line.
 constexpr size_t PARSE_LINE_LEN = 254;
 
-// The new file is written aside and renamed over the old one, so a crash or a
-// full disk never leaves a half-written configuration behind.
-#define CONFIG_TMP_FILE CONFIG_FILE ".tmp"
+#define CONFIG_NAME "tqlog_config"
+constexpr mode_t CONFIG_DIR_MODE = 0700;
+constexpr mode_t CONFIG_FILE_MODE = 0600;
 
 const char* const DEFAULT_KEYS[CONFIG_ITEM_COUNT] = {
     "autostart", "logpath", "logsize", "AndroidLog", "KernelLog", "BTLog", "totallogsize",
@@ -76,13 +77,12 @@ ConfigItem* find_item(ConfigCache* cache, const char* key) {
     return nullptr;
 }
 
-// fsync of the folder makes the rename itself durable.
-void sync_config_dir() {
-    UniqueFd dir(RETRY_EINTR(open(CONFIG_DIR, O_RDONLY | O_DIRECTORY | O_CLOEXEC)));
-    if (!dir.ok() || RETRY_EINTR(fsync(dir.get())) != 0) {
-        int err = errno;
-        HLOG(TAG_CONFIG, WLOG_ERROR, "write %s to configure file failed,erron:%d", CONFIG_DIR, err);
-    }
+// Files below /data are opened without following links: the folder of the
+// configuration belongs to the shell user. The system image is read-only.
+int open_for_reading(const char* path) {
+    const char* root = trusted_root_of(path, nullptr);
+    if (root != nullptr) return safe_open_path_file(root, path, SAFE_READ, 0);
+    return RETRY_EINTR(open(path, O_RDONLY | O_CLOEXEC));
 }
 
 }  // namespace
@@ -95,9 +95,10 @@ void config_init(ConfigCache* cache) {
 void config_make_dir() {
     if (access(CONFIG_DIR, F_OK) == 0) return;
     WLOG(TAG_CONFIG, WLOG_DEBUG, "create %s", CONFIG_DIR);
-    // A fresh /data may lack /data/misc; the folder itself stays private (0700).
+    // A fresh /data may lack /data/misc; the folder itself stays private.
     if (access("/data/misc", F_OK) != 0) make_dir_recursive("/data/misc");
-    if (mkdir(CONFIG_DIR, 0700) != 0 && errno != EEXIST) {
+    UniqueFd dir(open_daemon_dir(CONFIG_DIR_MODE));
+    if (!dir.ok()) {
         int err = errno;
         HLOG(TAG_CONFIG, WLOG_ERROR, "create %s failed, error:%s(%d)", CONFIG_DIR, strerror(err), err);
     }
@@ -125,7 +126,7 @@ int config_read_file(ConfigCache* cache, const char* path) {
     } else if (strcmp(path, SYSTEM_DEFAULTS_FILE) == 0) {
         cache->source = 1;
     }
-    UniqueFd fd(RETRY_EINTR(open(path, O_RDONLY | O_CLOEXEC)));
+    UniqueFd fd(open_for_reading(path));
     if (!fd.ok()) {
         int err = errno;
         HLOG(TAG_CONFIG, WLOG_ERROR, "open %s error (%s)", path, strerror(err));
@@ -175,12 +176,11 @@ int config_load(ConfigCache* cache) {
 }
 
 int config_write(const ConfigCache* cache) {
-    // A leftover of an interrupted write is replaced; O_EXCL then guarantees
-    // the mode and that the name is not a link planted elsewhere.
-    unlink(CONFIG_TMP_FILE);
-    UniqueFd fd(RETRY_EINTR(
-        open(CONFIG_TMP_FILE, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600)));
-    if (!fd.ok()) {
+    // The new file is written aside and renamed over the old one, so a crash or
+    // a full disk never leaves a half-written configuration behind.
+    UniqueFd dir(open_daemon_dir(CONFIG_DIR_MODE));
+    int fd = dir.ok() ? safe_replace_begin(dir.get(), CONFIG_NAME, CONFIG_FILE_MODE) : -1;
+    if (fd < 0) {
         int err = errno;
         HLOG(TAG_CONFIG, WLOG_ERROR, "cant open the config file,errno=%d,%s", err, strerror(err));
         return -1;
@@ -191,30 +191,22 @@ int config_write(const ConfigCache* cache) {
         char line[2 * CONFIG_FIELD_LEN + 2];
         int len = snprintf(line, sizeof(line), "%s=%s\n", item.key, item.value);
         if (len < 0 || len >= static_cast<int>(sizeof(line)) ||
-            write_fully(fd.get(), line, static_cast<size_t>(len)) != len) {
+            write_fully(fd, line, static_cast<size_t>(len)) != len) {
             int err = errno;
             // The record names the item without its line feed: one record, one line.
             if (len > 0 && len < static_cast<int>(sizeof(line))) line[len - 1] = '\0';
             HLOG(TAG_CONFIG, WLOG_ERROR, "write %s to configure file failed,erron:%d", line, err);
             // The old file stays in place rather than be replaced by an incomplete one.
-            unlink(CONFIG_TMP_FILE);
+            safe_replace_abort(dir.get(), CONFIG_NAME, fd);
             return -1;
         }
         count++;
     }
-    if (RETRY_EINTR(fsync(fd.get())) != 0 || close(fd.release()) != 0) {
-        int err = errno;
-        HLOG(TAG_CONFIG, WLOG_ERROR, "write %s to configure file failed,erron:%d", CONFIG_TMP_FILE, err);
-        unlink(CONFIG_TMP_FILE);
-        return -1;
-    }
-    if (rename(CONFIG_TMP_FILE, CONFIG_FILE) != 0) {
+    if (safe_replace_commit(dir.get(), CONFIG_NAME, fd) != 0) {
         int err = errno;
         HLOG(TAG_CONFIG, WLOG_ERROR, "write %s to configure file failed,erron:%d", CONFIG_FILE, err);
-        unlink(CONFIG_TMP_FILE);
         return -1;
     }
-    sync_config_dir();
     WLOG(TAG_CONFIG, WLOG_DEBUG, "write %d config item to file", count);
     return count;
 }

@@ -10,12 +10,27 @@
 
 namespace {
 
+bool is_symbolic_name(const char* value) {
+    return strcmp(value, "internal_sd") == 0 || strcmp(value, "external_sd") == 0;
+}
+
+bool is_clean_absolute_path(const char* path) {
+    if (path[0] != '/' || strlen(path) >= static_cast<size_t>(CONFIG_FIELD_LEN)) return false;
+    for (const char* at = path; *at != '\0';) {
+        while (*at == '/') at++;
+        size_t len = strcspn(at, "/");
+        if ((len == 1 && at[0] == '.') || (len == 2 && at[0] == '.' && at[1] == '.')) return false;
+        at += len;
+    }
+    return true;
+}
+
 // Directory of a storage from its property, or the fixed fallback when the
 // property is unset. Properties are read afresh: the storage may be remounted.
 void storage_dir(const char* property, const char* fallback, char* out) {
     char dir[PROPERTY_VALUE_MAX];
     property_get(property, dir, "");
-    if (dir[0] == '\0') {
+    if (!is_clean_absolute_path(dir)) {
         HLOG(TAG_CONFIG, WLOG_ERROR, "cant get log path through property %s", property);
         copy_str(out, CONFIG_FIELD_LEN, fallback);
     } else {
@@ -25,8 +40,18 @@ void storage_dir(const char* property, const char* fallback, char* out) {
 
 }  // namespace
 
+int log_path_value_valid(const char* value) {
+    return value != nullptr && (is_symbolic_name(value) || is_clean_absolute_path(value));
+}
+
 const char* resolve_log_path(const char* value, char* out) {
     if (value == nullptr) value = "";
+    if (!log_path_value_valid(value)) {
+        // A file edited by hand, or an override property: "tmp" would put the
+        // logs in the working folder, ".." components anywhere.
+        HLOG(TAG_CONFIG, WLOG_ERROR, "log path %s is not an absolute path, internal_sd used", value);
+        value = "internal_sd";
+    }
     if (strcmp(value, "internal_sd") == 0) {
         storage_dir("internal_sd_path", "/mnt/sdcard", out);
     } else if (strcmp(value, "external_sd") == 0) {

@@ -1,4 +1,6 @@
 // Copying the run options of a configuration into the controller.
+#include <errno.h>
+#include <limits.h>
 #include <stdlib.h>
 #include <string.h>
 
@@ -7,6 +9,20 @@
 #include "config/config_store.h"
 #include "core/log_controller.h"
 #include "storage/history_log.h"
+
+int logsize_from(const char* value) {
+    // A number and nothing else (a stored value may end in "\r" or a tab).
+    errno = 0;
+    char* end = nullptr;
+    long mb = strtol(value, &end, 10);
+    while (end != value && (*end == ' ' || *end == '\t' || *end == '\r')) end++;
+    if (end == value || *end != '\0' || errno == ERANGE || mb <= 0 || mb > INT_MAX) {
+        // 0 would rotate every file after each node: a run would keep seconds of logs.
+        HLOG(TAG_MAIN, WLOG_ERROR, "logsize %s is not a size in MB, %d used", value, DEFAULT_LOGSIZE_MB);
+        return DEFAULT_LOGSIZE_MB;
+    }
+    return static_cast<int>(mb);
+}
 
 void LogController::load_boot_options(ConfigCache& config) {
     autostart = logsize = totallogsize = 0;
@@ -21,7 +37,7 @@ void LogController::load_boot_options(ConfigCache& config) {
         copy_str(logpath, sizeof(logpath), value);
         if (strcmp(logpath, "/data") == 0) sd_log_path = 0;
     }
-    if ((value = config_get(&config, "logsize"))) logsize = atoi(value);
+    if ((value = config_get(&config, "logsize"))) logsize = logsize_from(value);
     if ((value = config_get(&config, "totallogsize"))) totallogsize = atoi(value);
     if ((value = config_get(&config, "AndroidLog"))) {
         android_log = atoi(value);

@@ -10,6 +10,7 @@
 #include "common/io_util.h"
 #include "common/wlog.h"
 #include "config/config_store.h"
+#include "config/log_path.h"
 #include "core/boot_copy.h"
 #include "core/client_table.h"
 #include "core/control_socket.h"
@@ -57,7 +58,7 @@ static void load_path_and_size(LogController* controller) {
     if ((value = config_get(&cache, "logpath"))) {
         copy_str(controller->logpath, sizeof(controller->logpath), value);
     }
-    if ((value = config_get(&cache, "logsize"))) controller->logsize = atoi(value);
+    if ((value = config_get(&cache, "logsize"))) controller->logsize = logsize_from(value);
 }
 
 // Loads the options and names and creates the run folder. Returns 1, or 0
@@ -73,7 +74,7 @@ static int prepare_run(LogController* controller) {
 
 // Starts a run in the folder prepare_run made.
 static void launch_run(LogController* controller) {
-    publish_run_folder(controller->run_folder);
+    publish_run_folder(controller, controller->run_folder);
     controller->rotate_size_kb = calc_rotate_size(controller, controller->logsize);
     start_logging(controller);
 }
@@ -93,7 +94,7 @@ static int start_by_command(LogController* controller, int fd, const char* word)
 }
 
 static int cmd_deep_start(LogController* controller, int fd) {
-    if (is_running()) {
+    if (run_live(controller)) {
         HLOG(TAG_MAIN, WLOG_INFO, "tqlog already running, why send deep_start");
         reply_word(controller, fd, CMD_DEEP_START, REPLY_DONE);
         return 1;
@@ -109,7 +110,7 @@ static int cmd_deep_start(LogController* controller, int fd) {
 }
 
 static int cmd_start(LogController* controller, int fd) {
-    if (is_running()) {
+    if (run_live(controller)) {
         HLOG(TAG_MAIN, WLOG_INFO, "tqlog already running, why send start");
         reply_word(controller, fd, CMD_START, REPLY_DONE);
         return 1;
@@ -153,7 +154,7 @@ static int move_run_to_log_path(LogController* controller, int fd) {
 }
 
 static int cmd_copy(LogController* controller, int fd) {
-    if (is_running()) {
+    if (run_live(controller)) {
         if (controller->log_path_state == 1) {
             HLOG(TAG_MAIN, WLOG_ERROR, "has copyed to sd,ignore this 'copy'");
             reply_word(controller, fd, CMD_COPY, REPLY_DONE);
@@ -221,8 +222,9 @@ int handle_client_message(LogController* controller, int fd) {
         return 0;
     }
     // The last byte is the command's terminator. The text is taken up to its
-    // first NUL, so bytes a client sent after one are ignored.
+    // first NUL; a command word ignores what follows it anyway.
     message[n - 1] = '\0';
+    bool inner_nul = strlen(message) < static_cast<size_t>(n - 1);
     char shown[PRINTABLE_MAX];
     HLOG(TAG_MAIN, WLOG_INFO, "recv '%s' from client %d", printable(message, shown, sizeof(shown)),
          fd);
@@ -244,21 +246,30 @@ int handle_client_message(LogController* controller, int fd) {
             break;
     }
     // Configuration messages are answered with their trimmed text (leading
-    // spaces kept), valid or not: the reply confirms receipt, not the change.
-    apply_config_message(controller, message);
-    reply_word(controller, fd, message, REPLY_DONE);
+    // spaces kept) and ",1", or ",0" when the value was refused as unsafe to
+    // store; a message that is no setting at all is only recorded.
+    int stored;
+    if (inner_nul) {
+        // What follows the NUL would be stored or lost unseen.
+        trim(message);
+        HLOG(TAG_MAIN, WLOG_ERROR, "%s is not a valid configure (NUL byte)",
+             printable(message, shown, sizeof(shown)));
+        stored = 0;
+    } else {
+        stored = apply_config_message(controller, message);
+    }
+    reply_word(controller, fd, message, stored ? REPLY_DONE : REPLY_FAILED);
     return 1;
 }
 
 // Why a configuration text cannot be stored, or nullptr when it can.
 static const char* config_fault(const char* key, const char* value) {
-    for (const char* p = key; *p; p++) {
-        if (static_cast<unsigned char>(*p) < 0x20 || *p == 0x7f) return "control character";
-    }
-    // A line feed in a value would add a line of its own to the configuration file.
-    for (const char* p = value; *p; p++) {
-        if (static_cast<unsigned char>(*p) < 0x20 || *p == 0x7f) return "control character";
-    }
+    // A line feed would add a line of its own to the configuration file;
+    // other bytes (a trailing "\r", a tab) are stored as they come.
+    if (strchr(key, '\n') != nullptr || strchr(value, '\n') != nullptr) return "line feed";
+    // Stored empty, a value reads back from the file as a lone line feed,
+    // which the next rewrite turns into a line of its own.
+    if (value[0] == '\0') return "empty value";
     // Items hold at most CONFIG_FIELD_LEN - 1 characters and a stored line
     // "key=value\n" at most 99: a longer value would be stored cut.
     size_t key_len = strlen(key), value_len = strlen(value);
@@ -266,10 +277,11 @@ static const char* config_fault(const char* key, const char* value) {
         value_len >= static_cast<size_t>(CONFIG_FIELD_LEN) || key_len + value_len > 97) {
         return "too long";
     }
+    if (strcmp(key, "logpath") == 0 && !log_path_value_valid(value)) return "not an absolute path";
     return nullptr;
 }
 
-void apply_config_message(LogController* controller, char* text) {
+int apply_config_message(LogController* controller, char* text) {
     (void)controller;
     char* message = trim(text);
     char shown[PRINTABLE_MAX];
@@ -278,7 +290,7 @@ void apply_config_message(LogController* controller, char* text) {
     if (!equal) {
         HLOG(TAG_MAIN, WLOG_ERROR, "%s is not a valid configure",
              printable(message, shown, sizeof(shown)));
-        return;
+        return 1;
     }
     char key[CONTROL_MSG_MAX + 1];
     char value[CONTROL_MSG_MAX + 1];
@@ -296,7 +308,7 @@ void apply_config_message(LogController* controller, char* text) {
         if (!underscore) {
             HLOG(TAG_MAIN, WLOG_ERROR, "%s is not a valid configure",
                  printable(message, shown, sizeof(shown)));
-            return;
+            return 1;
         }
         real_key = underscore + 1;
     }
@@ -304,11 +316,12 @@ void apply_config_message(LogController* controller, char* text) {
     if (fault) {
         HLOG(TAG_MAIN, WLOG_ERROR, "%s is not a valid configure (%s)",
              printable(message, shown, sizeof(shown)), fault);
-        return;
+        return 0;
     }
 
     WLOG(TAG_MAIN, WLOG_DEBUG, "new config, key: %s, value:%s", real_key, value);
     ConfigCache cache;
     config_init(&cache);
     config_change(&cache, real_key, value);
+    return 1;
 }

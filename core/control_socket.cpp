@@ -12,6 +12,7 @@
 #include <sys/prctl.h>
 #include <sys/select.h>
 #include <sys/socket.h>
+#include <time.h>
 #include <unistd.h>
 
 #include <cutils/sockets.h>
@@ -29,6 +30,8 @@
 #include "storage/storage_check.h"
 
 time_t boot_copy_timeout_s = BOOT_COPY_TIMEOUT_S;
+// How often "tavlologd" is tried again while another process holds it.
+static constexpr long long CONTROL_RETRY_MS = 3000;
 
 static void* control_thread(void* arg) {
     prctl(PR_SET_NAME, "tavlo.control", 0, 0, 0);
@@ -36,23 +39,46 @@ static void* control_thread(void* arg) {
     return nullptr;
 }
 
-void start_control_socket(LogController* controller) {
+// Creates and listens on "tavlologd". Returns the descriptor, or -1 with
+// *failed_step 1 (create) or 2 (listen).
+static int open_control_socket(int* failed_step) {
     int fd =
         socket_local_server(CONTROL_SOCKET_NAME, ANDROID_SOCKET_NAMESPACE_ABSTRACT, SOCK_STREAM);
     if (fd < 0) {
-        HLOG(TAG_MAIN, WLOG_ERROR, "create socket 'tavlologd' failed");
-        report_system_warning(1);
-        exit(-1);
+        *failed_step = 1;
+        return -1;
     }
     // The daemon runs shell commands ("oru -m 3"); they must not inherit the socket.
     fcntl(fd, F_SETFD, FD_CLOEXEC);
-    controller->listen_fd = fd;
-    WLOG(TAG_MAIN, WLOG_DEBUG, "create socket 'tavlologd' success");
-
     if (listen(fd, CONTROL_BACKLOG) < 0) {
+        *failed_step = 2;
+        close(fd);
+        return -1;
+    }
+    return fd;
+}
+
+// Records why "tavlologd" could not be opened; once, not at every retry.
+static void record_socket_failure(int failed_step) {
+    if (failed_step == 1) {
+        HLOG(TAG_MAIN, WLOG_ERROR, "create socket 'tavlologd' failed");
+    } else {
         HLOG(TAG_MAIN, WLOG_ERROR, "listen socket 'tavlologd' error\n");
-        report_system_warning(2);
-        exit(-1);
+    }
+    report_system_warning(failed_step);
+}
+
+void start_control_socket(LogController* controller) {
+    int failed_step = 0;
+    controller->listen_fd = open_control_socket(&failed_step);
+    if (controller->listen_fd >= 0) {
+        WLOG(TAG_MAIN, WLOG_DEBUG, "create socket 'tavlologd' success");
+    } else {
+        // Most likely another process holds the name since this daemon's
+        // predecessor died: exiting would only make init restart us in a
+        // loop. The control thread retries and serves as soon as it can, and
+        // meanwhile a boot-time run keeps its supervision.
+        record_socket_failure(failed_step);
     }
 
     pthread_t thread;
@@ -64,6 +90,18 @@ void start_control_socket(LogController* controller) {
     }
     // Never joined: the thread lives as long as the process.
     pthread_detach(thread);
+}
+
+// Another try at "tavlologd" while it cannot be had.
+static void retry_control_socket(LogController* controller, int* retries) {
+    int failed_step = 0;
+    int fd = open_control_socket(&failed_step);
+    if (fd < 0) {
+        (*retries)++;
+        return;
+    }
+    controller->listen_fd = fd;
+    HLOG(TAG_MAIN, WLOG_INFO, "socket 'tavlologd' ready after %d retries", *retries + 1);
 }
 
 // Accepts one connection into a free slot, or closes it at once when the peer
@@ -82,21 +120,25 @@ static int accept_client(LogController* controller) {
 
     uid_t uid = 0;
     pid_t pid = 0;
+    // The records of refused connections are rate-limited: an app can
+    // connect in a loop, and each record would grow the history.
     if (!peer_credentials(fd, &uid, &pid)) {
-        HLOG(TAG_MAIN, WLOG_ERROR, "cannot get credentials of client fd:%d(%s), close it", fd,
-             strerror(errno));
+        int err = errno;
+        HLOG_LIMITED(refused_control_peers, TAG_MAIN, WLOG_ERROR,
+                     "cannot get credentials of client fd:%d(%s), close it", fd, strerror(err));
         close(fd);
         return 1;
     }
     if (!control_peer_allowed(uid)) {
-        HLOG(TAG_MAIN, WLOG_WARN, "refuse client uid %d pid %d", static_cast<int>(uid),
-             static_cast<int>(pid));
+        HLOG_LIMITED(refused_control_peers, TAG_MAIN, WLOG_WARN, "refuse client uid %d pid %d",
+                     static_cast<int>(uid), static_cast<int>(pid));
         close(fd);
         return 1;
     }
     // select() cannot watch a descriptor at or above FD_SETSIZE.
     if (fd >= FD_SETSIZE) {
-        HLOG(TAG_MAIN, WLOG_ERROR, "client fd:%d out of select range, close it", fd);
+        HLOG_LIMITED(refused_control_peers, TAG_MAIN, WLOG_ERROR,
+                     "client fd:%d out of select range, close it", fd);
         close(fd);
         return 1;
     }
@@ -105,8 +147,9 @@ static int accept_client(LogController* controller) {
     int slot = add_client(controller, fd, addr);
     pthread_mutex_unlock(&controller->client_lock);
     if (slot < 0) {
-        HLOG(TAG_MAIN, WLOG_WARN, "no free slot for client uid %d pid %d, close fd:%d",
-             static_cast<int>(uid), static_cast<int>(pid), fd);
+        HLOG_LIMITED(refused_control_peers, TAG_MAIN, WLOG_WARN,
+                     "no free slot for client uid %d pid %d, close fd:%d", static_cast<int>(uid),
+                     static_cast<int>(pid), fd);
         close(fd);
         return 1;
     }
@@ -135,33 +178,54 @@ static unsigned long long read_counter(int fd) {
     return value;
 }
 
+static long long now_ms() {
+    struct timespec ts;
+    clock_gettime(CLOCK_MONOTONIC, &ts);
+    return static_cast<long long>(ts.tv_sec) * 1000 + ts.tv_nsec / 1000000;
+}
+
+static void keep_earliest(long long* wait_ms, long long ms) {
+    if (ms < 0) ms = 0;
+    if (*wait_ms < 0 || ms < *wait_ms) *wait_ms = ms;
+}
+
+static void watch(fd_set* set, int fd, int* max_fd) {
+    FD_SET(fd, set);
+    if (fd > *max_fd) *max_fd = fd;
+}
+
 void control_loop(LogController* controller) {
-    // select() subtracts the time it waited, so the 300 seconds are spent over
-    // every wait while the timer is armed, not restarted by each event.
-    struct timeval timeout = {boot_copy_timeout_s, 0};
+    // The time-out counts from the start of the loop: any event disarms it,
+    // so until then all the time was spent waiting.
+    const long long boot_copy_deadline = now_ms() + static_cast<long long>(boot_copy_timeout_s) * 1000;
+    long long next_bind_try = now_ms() + CONTROL_RETRY_MS;
+    int bind_retries = 0;
 
     for (;;) {
+        if (controller->listen_fd < 0 && now_ms() >= next_bind_try) {
+            retry_control_socket(controller, &bind_retries);
+            next_bind_try = now_ms() + CONTROL_RETRY_MS;
+        }
         fd_set readable;
         FD_ZERO(&readable);
-        int max_fd = controller->listen_fd;
-        FD_SET(controller->listen_fd, &readable);
-        if (efd_chld > 0) {
-            FD_SET(efd_chld, &readable);
-            if (efd_chld > max_fd) max_fd = efd_chld;
-        }
-        if (efd_thread > 0) {
-            FD_SET(efd_thread, &readable);
-            if (efd_thread > max_fd) max_fd = efd_thread;
-        }
+        int max_fd = -1;
+        if (controller->listen_fd >= 0) watch(&readable, controller->listen_fd, &max_fd);
+        if (efd_chld > 0) watch(&readable, efd_chld, &max_fd);
+        if (efd_thread > 0) watch(&readable, efd_thread, &max_fd);
         // Only this thread changes the slots, so they can be read without the lock.
         for (const ClientSlot& slot : controller->clients) {
-            if (slot.fd < 0) continue;
-            FD_SET(slot.fd, &readable);
-            if (slot.fd > max_fd) max_fd = slot.fd;
+            if (slot.fd >= 0) watch(&readable, slot.fd, &max_fd);
         }
 
-        int ready = select(max_fd + 1, &readable, nullptr, nullptr,
-                           controller->boot_copy_timer ? &timeout : nullptr);
+        long long wait_ms = -1;
+        if (controller->boot_copy_timer) keep_earliest(&wait_ms, boot_copy_deadline - now_ms());
+        if (controller->listen_fd < 0) keep_earliest(&wait_ms, next_bind_try - now_ms());
+        int flush_ms = peer_records_flush();
+        if (flush_ms >= 0) keep_earliest(&wait_ms, flush_ms);
+        struct timeval timeout = {static_cast<time_t>(wait_ms / 1000),
+                                  static_cast<suseconds_t>(wait_ms % 1000 * 1000)};
+
+        int ready = select(max_fd + 1, &readable, nullptr, nullptr, wait_ms >= 0 ? &timeout : nullptr);
         if (ready < 0) {
             // A SIGCHLD delivered to this thread is no failure; the event
             // counter it wrote is seen in the next pass.
@@ -171,6 +235,8 @@ void control_loop(LogController* controller) {
             continue;
         }
         if (ready == 0) {
+            // Other waits (a retry, a record summary) end here too.
+            if (!controller->boot_copy_timer || now_ms() < boot_copy_deadline) continue;
             HLOG(TAG_MAIN, WLOG_ERROR, "select() timeout");
             controller->boot_copy_timer = 0;
             if (boot_fail_copy(controller) < 0) {
@@ -185,7 +251,7 @@ void control_loop(LogController* controller) {
         bool boot_copy_armed = controller->boot_copy_timer != 0;
         controller->boot_copy_timer = 0;
 
-        if (FD_ISSET(controller->listen_fd, &readable)) {
+        if (controller->listen_fd >= 0 && FD_ISSET(controller->listen_fd, &readable)) {
             if (!accept_client(controller)) {
                 sleep(1);
                 continue;
@@ -212,9 +278,12 @@ void control_loop(LogController* controller) {
         }
         if (efd_thread > 0 && FD_ISSET(efd_thread, &readable)) {
             // 1001 storage low, 1002 log folder lost (or their sum): either way the run ends.
+            // 0: a stop in this pass has already discarded what was there.
             unsigned long long events = read_counter(efd_thread);
-            HLOG(TAG_MAIN, WLOG_INFO, "recv efd_thread %llu", events);
-            stop_logging(controller);
+            if (events != 0) {
+                HLOG(TAG_MAIN, WLOG_INFO, "recv efd_thread %llu", events);
+                stop_logging(controller);
+            }
         }
     }
 }

@@ -18,4 +18,6 @@ void control_loop(LogController* controller);
 int handle_client_message(LogController* controller, int fd);
 // Writes text to the client fd, or to every connected client when fd is -1.
 void reply_client(LogController* controller, int fd, const char* text);
-void apply_config_message(LogController* controller, char* text);
+// Applies one key=value message. Returns 0 when it was refused as unsafe to
+// store (a line feed, too long, a logpath that is no absolute path), else 1.
+int apply_config_message(LogController* controller, char* text);

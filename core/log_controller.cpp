@@ -46,3 +46,7 @@ bool is_running() {
     property_get(PROP_RUNNING, value, "0");
     return atoi(value) != 0;
 }
+
+bool run_live(const LogController* controller) {
+    return controller->run_active || is_running();
+}

@@ -39,6 +39,9 @@ class LogController {
     int warned = 0;
     // -1 nothing known, 0 a temporary folder in /data, 1 a folder under the log path.
     int log_path_state = -1;
+    // The daemon's own record of a live run, from start_logging to the end of
+    // stop_logging. debug.TQ.running publishes it, but the shell can set that.
+    bool run_active = false;
     pthread_mutex_t client_lock;  // guards clients; taken before reply_lock
     pthread_mutex_t reply_lock;   // serialises every write to clients
     pid_t klog_pid = 0;
@@ -72,5 +75,13 @@ extern int data_storage_low;
 #define PROP_REALPATH "debug.TQ.realpath"
 #define PROP_LOGSIZE "debug.TQ.logsize"
 
+// The size of a run in MB from a logsize value; one that is not a positive
+// number is recorded and gives the default.
+constexpr int DEFAULT_LOGSIZE_MB = 300;
+int logsize_from(const char* value);
+
 // atoi of debug.TQ.running (default "0") is not 0.
 bool is_running();
+
+// A run is live by the controller's own record, or as debug.TQ.running says.
+bool run_live(const LogController* controller);

@@ -23,12 +23,14 @@
 #include "collectors/control_block.h"
 #include "collectors/fork_collectors.h"
 #include "common/io_util.h"
+#include "common/unique_fd.h"
 #include "common/wlog.h"
 #include "core/child_supervision.h"
 #include "core/log_controller.h"
 #include "platform/properties.h"
 #include "storage/folder_records.h"
 #include "storage/history_log.h"
+#include "storage/safe_file.h"
 #include "transist/transist.h"
 
 #define RUN_FOLDER_ROOT "/qrvlog/tavlolog/"
@@ -73,21 +75,17 @@ int create_run_folder(LogController* controller, const char* base, const char* p
     if (needs_slash) folder[len++] = '/';
     folder[len] = '\0';
 
-    const char* at = strstr(folder, base);
-    if (at == nullptr || path[0] == '\0') {
-        HLOG(TAG_MAIN, WLOG_ERROR, "mkdir %s refused: not under %s", folder, base);
-        return -1;
-    }
-    for (char* p = folder + (at - folder) + 1; *p != '\0'; p++) {
-        if (*p != '/') continue;
-        *p = '\0';
-        if (access(folder, F_OK) != 0 && mkdir(folder, 0770) != 0) {
-            int err = errno;
-            HLOG(TAG_MAIN, WLOG_ERROR, "mkdir %s fails, errno:%s(%d)", folder, strerror(err), err);
+    // base is trusted as it stands (a log path may be a link); below it an
+    // app that can write the card may have planted links: none is followed.
+    char failed_at[PATH_LEN];
+    UniqueFd dir(path[0] == '\0' ? -1 : safe_open_dir(base, folder, true, 0770, failed_at));
+    if (!dir.ok()) {
+        int err = path[0] == '\0' ? EINVAL : errno;
+        if (err == EINVAL && failed_at[0] == '\0') {
+            HLOG(TAG_MAIN, WLOG_ERROR, "mkdir %s refused: not under %s", folder, base);
+            return -1;
         }
-        *p = '/';
-    }
-    if (access(folder, F_OK) != 0) {
+        HLOG(TAG_MAIN, WLOG_ERROR, "mkdir %s fails, errno:%s(%d)", failed_at, strerror(err), err);
         HLOG(TAG_MAIN, WLOG_ERROR, "mkdir %s fails at last", folder);
         return -1;
     }
@@ -177,6 +175,7 @@ void start_logging(LogController* controller) {
     if (controller->boot_mode == 0) oru_mode_on();
     set_logsize_property(controller->rotate_size_kb);
     property_set(PROP_RUNNING, "1");
+    controller->run_active = true;
 
     transist_create(controller, controller->run_folder, controller->rotate_size_kb);
     create_control_block(controller);
@@ -255,12 +254,22 @@ static void join_transist_thread(pthread_t* thread, const char* which) {
     }
 }
 
+// A notice the writer sent while the run was stopping belongs to that run;
+// left in the counter it would stop the next run as soon as it starts.
+static void discard_stale_notices() {
+    uint64_t stale;
+    while (efd_thread >= 0 && RETRY_EINTR(read(efd_thread, &stale, sizeof(stale))) > 0) {
+    }
+}
+
 void stop_logging(LogController* controller) {
     // The collectors ended below are reaped by the system and start no check.
     signal(SIGCHLD, SIG_IGN);
-    controller->log_path_state = -1;
-    if (!is_running()) {
+    // The daemon's own record decides: the property may have been set by hand.
+    if (!controller->run_active) {
+        controller->log_path_state = -1;
         HLOG(TAG_MAIN, WLOG_ERROR, "tavlolog already stopped, ignore this stop");
+        if (is_running()) property_set(PROP_RUNNING, "0");
         return;
     }
     property_set(PROP_RUNNING, "0");
@@ -290,10 +299,17 @@ void stop_logging(LogController* controller) {
     join_transist_thread(&read_thread_id, "read");
     join_transist_thread(&write_thread_id, "write");
     stop_requested = false;
+    controller->run_active = false;
+    // Only now: until the writer has ended it must check the free space of
+    // the run's own root (/data for a run held there), not the card's.
+    controller->log_path_state = -1;
+    discard_stale_notices();
     HLOG(TAG_MAIN, WLOG_INFO, "tavlolog stop done");
 }
 
-void publish_run_folder(const char* path) {
+void publish_run_folder(LogController* controller, const char* path) {
+    // The history opens the run's file below the part of the path trusted as it stands.
+    set_run_folder_root(controller->logpath);
     if (property_set(PROP_REALPATH, path) == 0) return;
     // A folder longer than a property value can hold: the run's history records
     // must not go on landing in the previous run's folder.
@@ -302,7 +318,7 @@ void publish_run_folder(const char* path) {
 }
 
 void switch_run_folder(LogController* controller, const char* path) {
-    publish_run_folder(path);
+    publish_run_folder(controller, path);
     set_logsize_property(controller->rotate_size_kb);
     change_log_folder(path, controller->rotate_size_kb);
     sleep(1);

@@ -9,11 +9,17 @@
 #include "core/boot_start.h"
 #include "core/log_controller.h"
 #include "core/privileges.h"
+#include "platform/properties.h"
 #include "storage/history_log.h"
 
 int main() {
     // A client or collector that has gone must give EPIPE, not end the daemon.
     signal(SIGPIPE, SIG_IGN);
+    // A daemon restarted after a death finds its predecessor's run in these:
+    // before anything reads them, no run is live and no run folder may receive
+    // this daemon's records.
+    property_set(PROP_REALPATH, "");
+    property_set(PROP_RUNNING, "0");
 
     if (getuid() != 0) {
         HLOG(TAG_DEBUG, WLOG_INFO, "[== First Log ==] tavlo_log_d is not in root user");

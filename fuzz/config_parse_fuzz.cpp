@@ -19,12 +19,12 @@
 #include <vector>
 
 #include "config/config_store.h"
+#include "fuzz/fuzz_util.h"
 
 namespace {
 
 constexpr unsigned long DEFAULT_SEED = 0x7a7101;
 constexpr double DEFAULT_SECONDS = 10.0;
-constexpr const char* HISTORY_FILE = "/data/misc/tqlog/tqlog_history";
 
 const char* const KEYS[CONFIG_ITEM_COUNT] = {"autostart", "logpath",  "logsize", "AndroidLog",
                                              "KernelLog", "BTLog", "totallogsize"};
@@ -37,23 +37,9 @@ unsigned long seed = DEFAULT_SEED;
 
 size_t pick(size_t n) { return n == 0 ? 0 : static_cast<size_t>(rng() % n); }
 
-std::string printable(const std::string& s) {
-    std::string out;
-    char hex[8];
-    for (unsigned char c : s) {
-        if (c >= 0x20 && c < 0x7f && c != '\\') {
-            out += static_cast<char>(c);
-        } else {
-            snprintf(hex, sizeof(hex), "\\x%02x", c);
-            out += hex;
-        }
-    }
-    return out;
-}
-
 [[noreturn]] void fail(const char* what, const std::string& input) {
     fprintf(stderr, "config_parse_fuzz: FAILED at iteration %lu (seed %lu): %s\ninput (%zu bytes): \"%s\"\n",
-            iteration, seed, what, input.size(), printable(input.substr(0, 4096)).c_str());
+            iteration, seed, what, input.size(), fuzz_printable(input.substr(0, 4096)).c_str());
     abort();
 }
 
@@ -197,8 +183,8 @@ void check_cache(const ConfigCache& cache, const Model& expected, const std::str
         if (strnlen(item.value, CONFIG_FIELD_LEN) >= static_cast<size_t>(CONFIG_FIELD_LEN)) fail("value not terminated", input);
         if (strcmp(item.key, KEYS[i]) != 0) fail("a key changed", input);
         if (expected.values[i] != item.value) {
-            fprintf(stderr, "item %s: got \"%s\", model \"%s\"\n", KEYS[i], printable(item.value).c_str(),
-                    printable(expected.values[i]).c_str());
+            fprintf(stderr, "item %s: got \"%s\", model \"%s\"\n", KEYS[i], fuzz_printable(item.value).c_str(),
+                    fuzz_printable(expected.values[i]).c_str());
             fail("value differs from the model", input);
         }
     }
@@ -235,42 +221,19 @@ void write_file(const char* path, const std::string& content) {
     close(fd);
 }
 
-// Unknown keys are recorded; keep the history from filling the image.
-void limit_history() {
-    struct stat st;
-    if (stat(HISTORY_FILE, &st) == 0 && st.st_size > (4 << 20)) unlink(HISTORY_FILE);
-}
-
-double now_seconds() {
-    struct timespec ts;
-    clock_gettime(CLOCK_MONOTONIC, &ts);
-    return static_cast<double>(ts.tv_sec) + static_cast<double>(ts.tv_nsec) / 1e9;
-}
-
 }  // namespace
 
 int main(int argc, char** argv) {
-    if (access("/dev/emu/properties", F_OK) != 0) {
-        fprintf(stderr, "config_parse_fuzz: run it inside the emulated phone (tools/tavlo-emu sandbox)\n");
-        return 2;
-    }
     double seconds = DEFAULT_SECONDS;
-    const char* env_seconds = getenv("TAVLO_FUZZ_SECONDS");
-    const char* env_seed = getenv("TAVLO_FUZZ_SEED");
-    if (argc > 1) seconds = atof(argv[1]);
-    else if (env_seconds) seconds = atof(env_seconds);
-    if (argc > 2) seed = strtoul(argv[2], nullptr, 0);
-    else if (env_seed) seed = strtoul(env_seed, nullptr, 0);
-    printf("config_parse_fuzz: seed %lu, %.1f s\n", seed, seconds);
-    fflush(stdout);
+    fuzz_start("config_parse_fuzz", argc, argv, &seconds, &seed);
     rng.seed(seed);
 
     ConfigCache cache;
     config_init(&cache);
     std::string previous = "logsize=300\n";
-    double deadline = now_seconds() + seconds;
+    double deadline = fuzz_now() + seconds;
     unsigned long files = 0;
-    for (iteration = 0; now_seconds() < deadline; iteration++) {
+    for (iteration = 0; fuzz_now() < deadline; iteration++) {
         std::string line = random_line(previous);
         // Mutations of mutations grow; start over from a fresh line now and then.
         previous = line.size() > 8192 ? structured_line() : line;
@@ -305,7 +268,6 @@ int main(int argc, char** argv) {
             if (cache.source != (own ? 0 : 1)) fail("source not set from the path", content);
             check_cache(cache, file_model, content);
             files++;
-            limit_history();
         }
     }
     printf("config_parse_fuzz: %lu lines, %lu files, no failure\n", iteration, files);

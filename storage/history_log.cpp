@@ -8,6 +8,7 @@
 #include <stdarg.h>
 #include <stdio.h>
 #include <string.h>
+#include <sys/file.h>
 #include <sys/stat.h>
 #include <time.h>
 #include <unistd.h>
@@ -18,12 +19,15 @@
 #include "common/unique_fd.h"
 #include "common/wlog.h"
 #include "platform/properties.h"
+#include "storage/safe_file.h"
 
 namespace {
 
-#define HISTORY_DIR "/data/misc/tqlog"
-#define HISTORY_FILE "/data/misc/tqlog/tqlog_history"
+#define HISTORY_DIR DAEMON_DIR
 #define HISTORY_NAME "tqlog_history"
+#define HISTORY_PREVIOUS "tqlog_history.1"
+constexpr mode_t HISTORY_DIR_MODE = 0775;
+constexpr mode_t HISTORY_MODE = 0664;
 
 // Timestamp, message and joined line are each cut at this many characters.
 constexpr size_t RECORD_LEN = 254;
@@ -33,8 +37,12 @@ constexpr size_t RECORD_LEN = 254;
 pthread_mutex_t history_lock = PTHREAD_MUTEX_INITIALIZER;
 // 1 once the central file's mode has been set. Guarded by history_lock.
 int history_mode_set = 0;
+// Where the trusted part of a run folder ends (the log path, or "/data").
+// Guarded by history_lock.
+char run_folder_root[PATH_LEN];
 // True while this thread holds history_lock: a record written from inside a
-// record (make_dir_recursive failing under the lock) must not take it again.
+// record (a refusal the safe file helpers record under the lock) must not
+// take it again.
 thread_local bool holding_history_lock = false;
 
 // The C library's local-time conversion takes a process-wide lock that a fork
@@ -43,18 +51,58 @@ thread_local bool holding_history_lock = false;
 std::atomic<long> utc_offset{0};
 std::atomic<bool> forked_child{false};
 
+// Past this size a history file becomes the previous generation and a new one
+// is started: the diary keeps its recent past and can never fill /data.
+constexpr off_t HISTORY_MAX_BYTES = 1 << 20;
+
+// Renames the full file behind fd to the previous generation, unless another
+// process (a collector, or a daemon restarted meanwhile) got there first, and
+// opens the new file. The lock is only tried: nothing may hang a record.
+int start_generation(int dirfd, int fd, const struct stat& full) {
+    if (flock(fd, LOCK_EX | LOCK_NB) == 0) {
+        struct stat now;
+        if (fstatat(dirfd, HISTORY_NAME, &now, AT_SYMLINK_NOFOLLOW) == 0 && now.st_ino == full.st_ino &&
+            now.st_dev == full.st_dev) {
+            renameat(dirfd, HISTORY_NAME, dirfd, HISTORY_PREVIOUS);
+        }
+        flock(fd, LOCK_UN);
+    }
+    close(fd);
+    return safe_open_file(dirfd, HISTORY_NAME, SAFE_APPEND, HISTORY_MODE);
+}
+
 // Appends one record with a single write: O_APPEND places it at the end at the
 // moment of the write, so records of different processes never interleave.
-// A file that cannot be opened loses this record silently.
-void append_record(const char* path, const char* line, size_t len) {
-    UniqueFd fd(RETRY_EINTR(open(path, O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0666)));
-    if (fd.ok()) write_fully(fd.get(), line, len);
+// Returns the file's descriptor for the caller to close, or -1 when it could
+// not be opened (the record is lost in this file, silently).
+int append_record(int dirfd, const char* line, size_t len) {
+    int fd = safe_open_file(dirfd, HISTORY_NAME, SAFE_APPEND, HISTORY_MODE);
+    struct stat st;
+    if (fd >= 0 && fstat(fd, &st) == 0 && st.st_size >= HISTORY_MAX_BYTES) {
+        fd = start_generation(dirfd, fd, st);
+    }
+    if (fd >= 0) write_fully(fd, line, len);
+    return fd;
+}
+
+// The run's own file: the folder is opened below the root the daemon trusts
+// for it; a folder of unknown origin is trusted up to its parent only.
+void append_run_record(const char* folder, const char* line, size_t len) {
+    char parent[PATH_LEN];
+    const char* root = trusted_root_for(folder, run_folder_root, parent);
+    if (root == nullptr) return;
+    UniqueFd dir(safe_open_dir(root, folder, false, 0));
+    if (!dir.ok()) return;
+    UniqueFd fd(append_record(dir.get(), line, len));
 }
 
 // A record is one line: line breaks and other control bytes in a message
 // (a client's command text, a damaged configuration line) would forge or
 // garble lines, so they are shown as '?'. Tabs are harmless and stay.
 void make_printable(char* s) {
+    // A message that ends its line itself keeps its text whole.
+    size_t len = strlen(s);
+    if (len > 0 && s[len - 1] == '\n') s[len - 1] = '\0';
     for (; *s != '\0'; s++) {
         unsigned char c = static_cast<unsigned char>(*s);
         if ((c < 0x20 && c != '\t') || c == 0x7f) *s = '?';
@@ -118,13 +166,10 @@ void history_log(int level, const char* format, ...) {
 
     bool have_run_folder = false;
     if (level == 1 || level == 2) {
-        char path[PATH_LEN];
-        if (get_run_folder(path) != nullptr) {
+        char folder[PATH_LEN];
+        if (get_run_folder(folder) != nullptr) {
             have_run_folder = true;
-            if (strlen(path) + strlen(HISTORY_NAME) < sizeof(path)) {
-                strcat(path, HISTORY_NAME);
-                append_record(path, line, n);
-            }
+            append_run_record(folder, line, n);
         }
     }
 
@@ -132,27 +177,29 @@ void history_log(int level, const char* format, ...) {
     // central file, even if the run file could not be written.
     bool central = level == 0 || level == 2 || (level == 1 && !have_run_folder);
     if (central) {
-        bool dir_ok = true;
-        if (access(HISTORY_DIR, F_OK) != 0) {
-            history_mode_set = 0;
-            // Another process may create it at the same moment; that is success too.
-            if (make_dir_recursive(HISTORY_DIR) == 0 && access(HISTORY_DIR, F_OK) != 0) {
-                int err = errno;
-                WLOG(TAG_MLOG, WLOG_ERROR, "create dir %s failed(%s)", HISTORY_DIR, strerror(err));
-                dir_ok = false;
-            }
-        }
-        if (dir_ok) {
-            append_record(HISTORY_FILE, line, n);
-            // Once per process and after each re-creation of the folder.
-            if (history_mode_set == 0) {
-                chmod(HISTORY_FILE, 0664);
+        if (access(HISTORY_DIR, F_OK) != 0) history_mode_set = 0;
+        UniqueFd dir(open_daemon_dir(HISTORY_DIR_MODE));
+        if (!dir.ok()) {
+            int err = errno;
+            WLOG(TAG_MLOG, WLOG_ERROR, "create dir %s failed(%s)", HISTORY_DIR, strerror(err));
+        } else {
+            UniqueFd fd(append_record(dir.get(), line, n));
+            // Once per process and after each re-creation of the folder; through
+            // the descriptor, so never on what a link points to.
+            if (history_mode_set == 0 && fd.ok()) {
+                fchmod(fd.get(), HISTORY_MODE);
                 history_mode_set = 1;
             }
         }
     }
 
     holding_history_lock = false;
+    pthread_mutex_unlock(&history_lock);
+}
+
+void set_run_folder_root(const char* root) {
+    pthread_mutex_lock(&history_lock);
+    copy_str(run_folder_root, sizeof(run_folder_root), root ? root : "");
     pthread_mutex_unlock(&history_lock);
 }
 

@@ -19,6 +19,9 @@
 namespace {
 
 constexpr int DIR_FLAGS = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
+// A folder the daemon may pass through but not list (/data/misc is 01771):
+// enough to open and make what lies below it.
+constexpr int PASS_FLAGS = O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
 constexpr int MAX_TREE_DEPTH = 16;
 
 // Whoever can write the card can plant links as fast as it likes.
@@ -78,14 +81,26 @@ const char* describe(int dirfd, const char* name, char* out, size_t n) {
     return out;
 }
 
+int open_dir_at(int parent, const char* name) {
+    int fd = RETRY_EINTR(openat(parent, name, DIR_FLAGS));
+    if (fd < 0 && errno == EACCES) fd = RETRY_EINTR(openat(parent, name, PASS_FLAGS));
+    return fd;
+}
+
+int open_root_as_is(const char* root) {
+    int fd = RETRY_EINTR(open(root, O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (fd < 0 && errno == EACCES) fd = RETRY_EINTR(open(root, O_PATH | O_DIRECTORY | O_CLOEXEC));
+    return fd;
+}
+
 // Opens the trusted root as it stands (links followed), creating its missing
 // folders path by path when asked: it is trusted, so its parents are too.
 int open_root(const char* root, size_t len, bool create, mode_t mode, char* failed_at) {
     char buf[PATH_LEN];
-    if (len == 0) return RETRY_EINTR(open("/", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (len == 0) return open_root_as_is("/");
     memcpy(buf, root, len);
     buf[len] = '\0';
-    int fd = RETRY_EINTR(open(buf, O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    int fd = open_root_as_is(buf);
     if (fd >= 0 || errno != ENOENT || !create) {
         if (fd < 0 && failed_at) copy_str(failed_at, PATH_LEN, buf);
         return fd;
@@ -102,18 +117,18 @@ int open_root(const char* root, size_t len, bool create, mode_t mode, char* fail
         }
         buf[i] = saved;
     }
-    fd = RETRY_EINTR(open(buf, O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    fd = open_root_as_is(buf);
     if (fd < 0 && failed_at) copy_str(failed_at, PATH_LEN, buf);
     return fd;
 }
 
 // One component below an open folder, made when missing and asked to.
 int open_component(int parent, const char* name, const char* shown, bool create, mode_t mode) {
-    int fd = RETRY_EINTR(openat(parent, name, DIR_FLAGS));
+    int fd = open_dir_at(parent, name);
     if (fd < 0 && errno == ENOENT && create) {
         bool made = mkdirat(parent, name, mode) == 0;
         if (!made && errno != EEXIST) return -1;
-        fd = RETRY_EINTR(openat(parent, name, DIR_FLAGS));
+        fd = open_dir_at(parent, name);
         // The umask must not decide who may read the logs.
         if (fd >= 0 && made) fchmod(fd, mode);
     }
@@ -170,6 +185,17 @@ const char* trusted_root_of(const char* path, const char* logpath) {
     if (logpath != nullptr && logpath[0] != '\0' && is_below(path, logpath)) return logpath;
     if (is_below(path, "/data")) return "/data";
     return nullptr;
+}
+
+const char* trusted_root_for(const char* path, const char* logpath, char* buf) {
+    const char* root = trusted_root_of(path, logpath);
+    if (root != nullptr || path == nullptr || path[0] != '/') return root;
+    copy_str(buf, PATH_LEN, path);
+    size_t n = strlen(buf);
+    while (n > 1 && buf[n - 1] == '/') buf[--n] = '\0';
+    char* slash = strrchr(buf, '/');
+    slash[slash == buf ? 1 : 0] = '\0';
+    return buf;
 }
 
 int safe_open_dir(const char* root, const char* path, bool create, mode_t mode, char* failed_at) {

@@ -10,7 +10,9 @@
 // errno ELOOP or ENOTDIR. "." and ".." below the root are refused (EINVAL).
 //
 // Modes are set through the descriptor (fchmod) on creation, so they do not
-// depend on the umask. Every descriptor is O_CLOEXEC. Functions return a
+// depend on the umask. Every descriptor is O_CLOEXEC. A folder the daemon may
+// search but not read is opened with O_PATH: good for the *at calls below,
+// not for listing it or syncing it. Functions return a
 // descriptor or 0, and -1 with errno set on failure.
 #pragma once
 
@@ -23,6 +25,11 @@
 // The leading part of path to trust: logpath when path lies below it (or is
 // it), else "/data" for paths below /data, else nullptr. logpath may be null.
 const char* trusted_root_of(const char* path, const char* logpath);
+
+// trusted_root_of, or for a path below neither its parent folder (copied into
+// buf, PATH_LEN bytes): then only its last component is opened without
+// following links. nullptr for a path that is not absolute.
+const char* trusted_root_for(const char* path, const char* logpath, char* buf);
 
 // Opens the folder path, which must be root or lie below it. With create,
 // missing folders (the root's own ones included) are made with mode.

@@ -139,6 +139,12 @@ TEST_F(ConfigStoreTest, LoadRecreatesAnUnreadableFileFromTheCache) {
     EXPECT_TRUE(has_record("open /data/misc/tqlog/tqlog_config error (No such file or directory)"));
     EXPECT_TRUE(has_record("some thing wrong when read /data/misc/tqlog/tqlog_config,recreate a new one"));
     EXPECT_EQ(read_file(CONFIG_FILE), default_file_with("BTLog=0"));
+
+    write_file("/data/target", "autostart=1\n");  // a link in its place is never read or written through
+    ASSERT_EQ(unlink(CONFIG_FILE) + symlink("/data/target", CONFIG_FILE), 0);
+    config_load(&cache_);
+    EXPECT_EQ(read_file("/data/target"), "autostart=1\n");
+    EXPECT_EQ(read_file(CONFIG_FILE), default_file_with("BTLog=0"));
 }
 
 // 91 characters fit and survive a round trip; 92 are refused with a record.

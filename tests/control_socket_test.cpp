@@ -3,6 +3,8 @@
 
 #include <memory>
 
+#include <cutils/sockets.h>
+
 #include "common/control_client.h"
 #include "config/config_store.h"
 #include "core/client_table.h"
@@ -78,33 +80,43 @@ class ControlSocketTest : public ::testing::Test {
 TEST_F(ControlSocketTest, ConfigurationMessages) {
     const struct {
         std::string bytes;   // exactly what the client writes
-        std::string reply;   // the text before ",1"
+        std::string reply;   // the text before ",1" or ",0"
+        bool done;           // ",1": not refused as unsafe to store
         const char* key;     // setting to look at afterwards
         const char* value;   // its stored value afterwards
         const char* record;  // a history record that must appear, or nullptr
     } cases[] = {
-        {"KernelLog=0\n", "KernelLog=0", "KernelLog", "0", "recv 'KernelLog=0' from client"},
-        {std::string("sublog_BTLog=1\0", 15), "sublog_BTLog=1", "BTLog", "1", nullptr},
-        {std::string("sublogBTLog=1\0", 14), "sublogBTLog=1", "BTLog", "0", "sublogBTLog=1 is not a valid configure"},
-        {std::string("hello\0", 6), "hello", "BTLog", "0", "hello is not a valid configure"},
-        {std::string("=1\0", 3), "=1", "BTLog", "0", "=1 is not a valid configure"},
-        {"start", "star", "autostart", "0", "star is not a valid configure"},  // no terminator
-        {std::string("logsize=200   \0", 15), "logsize=200", "logsize", "200", nullptr},
-        {std::string("  logsize=250\0", 14), "  logsize=250", "logsize", "250", nullptr},  // leading spaces stay
-        {std::string("AndroidLog=0\0start\0", 19), "AndroidLog=0", "AndroidLog", "0", nullptr},  // after the NUL: ignored
-        {std::string("logsize=1\nlogpath=/x\0", 21), "logsize=1\nlogpath=/x", "logpath", "internal_sd",
-         "logsize=1\\x0alogpath=/x is not a valid configure"},
-        {std::string("\x01\x02\xfe=\x03\0", 6), "\x01\x02\xfe=\x03", "BTLog", "0",
-         "\\x01\\x02\xfe=\\x03 is not a valid configure"},
-        {"logpath=" + std::string(100, 'a') + '\0', "logpath=" + std::string(100, 'a'), "logpath", "internal_sd",
-         "is not a valid configure (too long)"},
-        {std::string("colour=blue\0", 12), "colour=blue", "logsize", "300", "update item colour=blue to cache failed"},
+        {"KernelLog=0\n", "KernelLog=0", true, "KernelLog", "0", "recv 'KernelLog=0' from client"},
+        {std::string("sublog_BTLog=1\0", 15), "sublog_BTLog=1", true, "BTLog", "1", nullptr},
+        {std::string("sublogBTLog=1\0", 14), "sublogBTLog=1", true, "BTLog", "0", "sublogBTLog=1 is not a valid configure"},
+        {std::string("hello\0", 6), "hello", true, "BTLog", "0", "hello is not a valid configure"},
+        {std::string("=1\0", 3), "=1", true, "BTLog", "0", "=1 is not a valid configure"},
+        {"start", "star", true, "autostart", "0", "star is not a valid configure"},  // no terminator
+        {std::string("logsize=200   \0", 15), "logsize=200", true, "logsize", "200", nullptr},
+        {std::string("  logsize=250\0", 14), "  logsize=250", true, "logsize", "250", nullptr},  // leading spaces stay
+        {std::string("BTLog=1\t\r\0", 10), "BTLog=1\t\r", true, "BTLog", "1\t\r", nullptr},  // add no line: stored
+        {std::string("AndroidLog=0\0start\0", 19), "AndroidLog=0", false, "AndroidLog", "1",
+         "AndroidLog=0 is not a valid configure (NUL byte)"},
+        {std::string("logsize=1\nlogpath=/x\0", 21), "logsize=1\nlogpath=/x", false, "logpath", "internal_sd",
+         "logsize=1\\x0alogpath=/x is not a valid configure (line feed)"},
+        {std::string("\x01\x02\xfe=\x03\0", 6), "\x01\x02\xfe=\x03", true, "BTLog", "0",
+         "recv '\\x01\\x02\xfe=\\x03' from client"},
+        {"logpath=" + std::string(100, 'a') + '\0', "logpath=" + std::string(100, 'a'), false, "logpath",
+         "internal_sd", "is not a valid configure (too long)"},
+        {std::string("logpath=tmp\0", 12), "logpath=tmp", false, "logpath", "internal_sd",
+         "logpath=tmp is not a valid configure (not an absolute path)"},
+        {std::string("logpath=/mnt/sdcard/../../data/misc\0", 36), "logpath=/mnt/sdcard/../../data/misc", false,
+         "logpath", "internal_sd", nullptr},
+        {std::string("logpath=/mnt/sdcard2/logs\0", 26), "logpath=/mnt/sdcard2/logs", true, "logpath",
+         "/mnt/sdcard2/logs", nullptr},
+        {std::string("logsize=\0", 9), "logsize=", false, "logsize", "300", "logsize= is not a valid configure (empty value)"},
+        {std::string("colour=blue\0", 12), "colour=blue", true, "logsize", "300", "update item colour=blue to cache failed"},
     };
     for (const auto& c : cases) {
         SCOPED_TRACE(c.reply);
         write_config(kBaseConfig);
         auto conn = connect_client();
-        EXPECT_EQ(c.reply + REPLY_DONE, exchange_raw(conn.get(), c.bytes, c.reply));
+        EXPECT_EQ(c.reply + (c.done ? REPLY_DONE : REPLY_FAILED), exchange_raw(conn.get(), c.bytes, c.reply));
         EXPECT_EQ(c.value, config_value(c.key));
         EXPECT_TRUE(c.record == nullptr || history_has(c.record)) << c.record << "\n" << read_file(kHistory);
         if (("\n" + kBaseConfig).find("\n" + std::string(c.key) + "=" + c.value + "\n") != std::string::npos) {
@@ -162,6 +174,20 @@ TEST_F(ControlSocketTest, CommandsWhileRunning) {
     ASSERT_EQ(0, property_set(PROP_RUNNING, "0"));
 }
 
+// The daemon's own record of a live run decides too: the shell can set
+// debug.TQ.running, and "0" must not let a start build a second run.
+TEST_F(ControlSocketTest, LiveRunIsKnownWhateverTheProperty) {
+    write_config("autostart=0\nlogpath=/data\nlogsize=300\nAndroidLog=0\nKernelLog=0\nBTLog=0\ntotallogsize=600\n");
+    auto conn = connect_client();
+    EXPECT_EQ("start,1", exchange(conn.get(), "start"));
+    ASSERT_EQ(0, property_set(PROP_RUNNING, "0"));
+    EXPECT_EQ("start,1", exchange(conn.get(), "start"));
+    EXPECT_TRUE(history_has("tqlog already running, why send start"));
+    EXPECT_EQ("stop,1", exchange(conn.get(), "stop"));
+    EXPECT_TRUE(history_has("tavlolog stop done"));
+    EXPECT_EQ(count_of(read_file(kHistory), "create read/write thread success"), 1u);
+}
+
 // A start whose folder cannot be made answers ",0" and drops the client.
 TEST_F(ControlSocketTest, StartFailsWithoutFolder) {
     write_config(config_with("logpath=/proc/tqlog"));
@@ -190,6 +216,24 @@ TEST_F(ControlSocketTest, EventCounters) {
     EXPECT_NE(read_file("/dev/emu/wlog").find("recv efd_thread 1001"), std::string::npos);
     auto conn = connect_client();  // the loop goes on serving clients
     EXPECT_EQ("x,1", exchange(conn.get(), "x"));
+}
+
+// "tavlologd" held by another process (after the daemon died): recorded once,
+// then the daemon serves as soon as the name is free instead of exiting.
+TEST(ControlSocketHeld, IsServedAsSoonAsItIsFree) {
+    write_config(kBaseConfig);
+    int holder = socket_local_server(CONTROL_SOCKET_NAME, ANDROID_SOCKET_NAMESPACE_ABSTRACT, SOCK_STREAM);
+    ASSERT_GE(holder, 0);
+    LogController* controller = new LogController();
+    controller->boot_mode = 1;
+    start_control_socket(controller);
+    EXPECT_TRUE(has_record("create socket 'tavlologd' failed"));
+    close(holder);
+    ControlConnection conn;
+    ASSERT_TRUE(wait_for([&] { return control_connect(&conn, 100) == CC_OK; }, 10000));
+    EXPECT_EQ("x,1", exchange(&conn, "x"));
+    EXPECT_EQ(count_of(read_file(kHistory), "create socket 'tavlologd' failed"), 1u);
+    EXPECT_TRUE(history_has("socket 'tavlologd' ready after"));
 }
 
 // Shell commands the daemon runs ("oru -m 3") must not inherit client

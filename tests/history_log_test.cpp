@@ -2,8 +2,6 @@
 #include "storage/history_log.h"
 
 #include <atomic>
-#include <future>
-#include <memory>
 #include <thread>
 
 #include "test_util.h"
@@ -111,9 +109,38 @@ TEST_F(HistoryLogTest, LineIsTimestampMessageAndNewline) {
 TEST_F(HistoryLogTest, ControlBytesCannotForgeLines) {
     history_log(0, "recv '%s' from client %d", "stop\n2026:01:01 00:00:00 forged\r\x1b", 3);
     EXPECT_EQ(messages_of(kHistory), Messages{"recv 'stop?2026:01:01 00:00:00 forged?\?' from client 3"});
+    unlink(kHistory);  // a message that ends its own line keeps its text
+    history_log(0, "listen socket 'tavlologd' error\n");
+    EXPECT_EQ(messages_of(kHistory), Messages{"listen socket 'tavlologd' error"});
+}
+
+// A full file becomes the previous generation; what another process planted
+// in a history file's or folder's place is never written through.
+TEST_F(HistoryLogTest, FilesAreBoundedAndNeverFollowLinks) {
+    set_run_folder(kRunFolder);
+    const std::string full(1 << 20, 'x');
+    for (const char* file : {kHistory, kRunFile}) write_file(file, full);
+    history_log(2, "next");
+    for (const char* file : {kHistory, kRunFile}) {
+        EXPECT_EQ(read_file(std::string(file) + ".1"), full) << file;
+        EXPECT_EQ(messages_of(file), Messages{"next"});
+    }
+
+    write_file("/data/target", "secret\n", 0600);
+    for (const char* file : {kHistory, kRunFile}) ASSERT_EQ(unlink(file) + symlink("/data/target", file), 0);
+    history_log(2, "through a link?");
+    EXPECT_EQ(read_file("/data/target"), "secret\n");
+    EXPECT_EQ(mode_of("/data/target"), 0600u);
+
+    ASSERT_EQ(system("rm -rf /data/misc/tqlog && mkdir /data/elsewhere && ln -s /data/elsewhere /data/misc/tqlog"), 0);
+    history_log(0, "into a linked folder?");
+    EXPECT_TRUE(files_in("/data/elsewhere").empty());
+    EXPECT_NE(read_file(kPlatformLog).find("create dir /data/misc/tqlog failed(Too many levels of symbolic links)"),
+              std::string::npos);
 }
 
 TEST_F(HistoryLogTest, DeletedFolderIsRecreatedWithItsModes) {
+    umask(022);  // whatever it is
     history_log(0, "first");
     EXPECT_EQ(mode_of(kHistory), 0664u);
     ASSERT_EQ(system("rm -rf /data/misc"), 0);
@@ -125,25 +152,9 @@ TEST_F(HistoryLogTest, DeletedFolderIsRecreatedWithItsModes) {
     chmod(kHistory, 0600);  // the mode is set once per folder, not on every record
     history_log(0, "third");
     EXPECT_EQ(mode_of(kHistory), 0600u);
-}
-
-// /data/misc as a plain file: make_dir_recursive fails, and records that,
-// while the history lock is held.
-TEST_F(HistoryLogTest, UncreatableFolderDropsTheRecordWithoutDeadlock) {
-    ASSERT_EQ(system("rm -rf /data/misc && touch /data/misc"), 0);
-    set_run_folder(kRunFolder);
-    // Detached: a deadlocked writer must fail the test, not hang it.
-    auto finished = std::make_shared<std::promise<void>>();
-    std::future<void> done = finished->get_future();
-    std::thread([finished] {
-        history_log(2, "under a broken folder");
-        finished->set_value();
-    }).detach();
-    ASSERT_EQ(done.wait_for(std::chrono::seconds(10)), std::future_status::ready) << "history_log deadlocked";
-    EXPECT_EQ(messages_of(kRunFile), Messages{"under a broken folder"});
-    std::string platform = read_file(kPlatformLog);
-    EXPECT_NE(platform.find("TavloLogD/Util: mkdir fail(Not a directory)"), std::string::npos) << platform;
-    EXPECT_NE(platform.find("TavloLogD/mlog: create dir /data/misc/tqlog failed(Not a directory)"), std::string::npos);
+    unlink(kHistory);  // but a new file is never made with more
+    history_log(0, "fourth");
+    EXPECT_EQ(mode_of(kHistory), 0664u);
 }
 
 TEST_F(HistoryLogTest, MakeDirRecursive) {
@@ -172,11 +183,11 @@ bool thread_blocked_in_open(pid_t tid) {
     return s.rfind("257 ", 0) == 0 || s.rfind("2 ", 0) == 0;
 }
 
-// A writer of the run file blocks in open() on a FIFO while it holds the
-// history lock; a child forked meanwhile must still be able to record.
+// A writer blocks in open() on a FIFO standing for the run-folder property
+// while it holds the history lock; a child forked meanwhile must still be able to record.
 TEST_F(HistoryLogTest, ForkedChildDoesNotInheritAHeldLock) {
-    ASSERT_EQ(mkfifo(kRunFile, 0666), 0);
-    set_run_folder(kRunFolder);
+    const char kProperty[] = "/dev/emu/properties/debug.TQ.realpath";
+    ASSERT_EQ(mkfifo(kProperty, 0666), 0);
     std::atomic<pid_t> writer_tid{0};
     std::thread writer([&writer_tid] {
         writer_tid = gettid();
@@ -192,10 +203,12 @@ TEST_F(HistoryLogTest, ForkedChildDoesNotInheritAHeldLock) {
     }
     ASSERT_GT(child, 0);
     bool child_done = exits_with(child, 0, 10000);
-    std::string from_fifo = read_file(kRunFile);  // releases the parent's writer
+    int fifo = open(kProperty, O_WRONLY);  // releases the parent's writer
+    ASSERT_EQ(write(fifo, kRunFolder, strlen(kRunFolder)), static_cast<ssize_t>(strlen(kRunFolder)));
+    close(fifo);
     writer.join();
     EXPECT_TRUE(child_done) << "child deadlocked on the inherited history lock";
-    EXPECT_NE(from_fifo.find("parent record\n"), std::string::npos);
+    EXPECT_EQ(messages_of(kRunFile), Messages{"parent record"});
     EXPECT_EQ(messages_of(kHistory), (Messages{"child record", "parent record"}));
 }
 

@@ -182,6 +182,23 @@ TEST_F(LogFilesTest, OutputFilesFollowTheControllerSwitches) {
     EXPECT_TRUE(history_has("open /data/run/kernel_log, fd = " + std::to_string(log_files[LOG_KERNEL].fd)));
 }
 
+// A link planted where a log file goes, or in place of the folder of a
+// running log, is refused; nothing is written through it.
+TEST_F(LogFilesTest, PlantedLinksAreNeverWrittenThrough) {
+    write_file("/data/target", "autostart=0\n");
+    ASSERT_EQ(symlink("/data/target", "/data/run/kernel_log"), 0);
+    open_run("/data/run/", 0, 1, 0);
+    EXPECT_EQ(log_files[LOG_KERNEL].fd, -1);
+    EXPECT_TRUE(history_has("/data/run/kernel_log is a symbolic link, refused"));
+
+    ASSERT_EQ(unlink("/data/run/kernel_log"), 0);
+    open_entry(LOG_MAIN, "/data/run/");
+    ASSERT_EQ(system("mv /data/run /data/old && mkdir /data/other && ln -s /data/other /data/run"), 0);
+    EXPECT_EQ(rotate_log_files(&log_files[LOG_MAIN]), -1);
+    EXPECT_TRUE(files_in("/data/other").empty());
+    EXPECT_EQ(read_file("/data/target"), "autostart=0\n");
+}
+
 TEST_F(LogFilesTest, CreateFailuresUseEachTypesText) {
     open_run("/data/missing/", 1, 0, 1);
     for (const LogFile& entry : log_files) EXPECT_EQ(entry.fd, -1);

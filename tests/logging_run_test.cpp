@@ -9,6 +9,7 @@
 #include <thread>
 
 #include "collectors/kmsg_cat.h"
+#include "config/config_store.h"
 #include "core/child_supervision.h"
 #include "core/log_controller.h"
 #include "test_util.h"
@@ -44,6 +45,22 @@ TEST(CalcRotateSize, SplitsTheRunSizeOverItsFiles) {
     EXPECT_TRUE(history_has("Invalid log file num:0"));
 }
 
+TEST(RunSize, ZeroNegativeOrGarbageGiveTheDefault) {
+    const struct {
+        const char* value;
+        int mb;
+    } cases[] = {{"60", 60}, {"200\r", 200}, {"0", 300}, {"-5", 300}, {"abc", 300}, {"12abc", 300}, {"", 300}};
+    for (const auto& c : cases) {
+        ConfigCache cache;
+        config_set_defaults(&cache);
+        strcpy(cache.items[2].value, c.value);  // logsize
+        LogController controller;
+        controller.load_boot_options(cache);
+        EXPECT_EQ(controller.logsize, c.mb) << c.value;
+    }
+    EXPECT_TRUE(history_has("logsize 0 is not a size in MB, 300 used"));
+}
+
 TEST(ComposeRunFolder, NamesTheFolderAfterTheStartTime) {
     LogController controller;
     strcpy(controller.logpath, "/mnt/sdcard");
@@ -67,7 +84,7 @@ TEST(ComposeRunFolder, NamesTheFolderAfterTheStartTime) {
 }
 
 TEST(CreateRunFolder, CreatesEveryMissingFolderWithGroupAccessOrRefuses) {
-    umask(0);
+    umask(077);  // the modes do not depend on it
     LogController controller;
     const struct {
         const char *base, *path, *created;  // the last folder, with its slash
@@ -88,8 +105,13 @@ TEST(CreateRunFolder, CreatesEveryMissingFolderWithGroupAccessOrRefuses) {
 
     write_file("/data/blocker", "");
     EXPECT_EQ(create_run_folder(&controller, "/data", "/data/blocker/run"), -1);
-    EXPECT_TRUE(history_has("mkdir /data/blocker/run fails, errno:Not a directory(20)"));
+    EXPECT_TRUE(history_has("mkdir /data/blocker fails, errno:Not a directory(20)"));
     EXPECT_TRUE(history_has("mkdir /data/blocker/run/ fails at last"));
+
+    // A link planted on the card (the log path itself may be one).
+    ASSERT_EQ(system("mkdir /data/elsewhere && ln -s /data/elsewhere /mnt/sdcard/qrvlog/next"), 0);
+    EXPECT_EQ(create_run_folder(&controller, "/mnt/sdcard", "/mnt/sdcard/qrvlog/next/APLog_1/"), -1);
+    EXPECT_TRUE(files_in("/data/elsewhere").empty());
 
     std::string too_long = "/data/" + std::string(249, 'y');  // 255 characters, no room for '/'
     EXPECT_EQ(create_run_folder(&controller, "/data", too_long.c_str()), -1);
@@ -98,10 +120,11 @@ TEST(CreateRunFolder, CreatesEveryMissingFolderWithGroupAccessOrRefuses) {
 }
 
 TEST(PublishRunFolder, AFolderTooLongForThePropertyClearsIt) {
-    publish_run_folder("/mnt/sdcard/qrvlog/tavlolog/APLog_2026_0304_070649/");
+    LogController controller;
+    publish_run_folder(&controller, "/mnt/sdcard/qrvlog/tavlolog/APLog_2026_0304_070649/");
     EXPECT_EQ(property(PROP_REALPATH), "/mnt/sdcard/qrvlog/tavlolog/APLog_2026_0304_070649/");
     std::string long_folder = "/mnt/" + std::string(90, 'd') + "/qrvlog/tavlolog/APLog_2026_0304_070650/";
-    publish_run_folder(long_folder.c_str());
+    publish_run_folder(&controller, long_folder.c_str());
     EXPECT_EQ(property(PROP_REALPATH), "") << "the earlier run's folder would receive this run's records";
     EXPECT_TRUE(history_has("set debug.TQ.realpath to " + long_folder + " failed"));
 }
@@ -253,6 +276,27 @@ TEST_F(RunTest, StopWithNoCollectorToWaitForIsQuick) {
     EXPECT_EQ(controller_.log_path_state, -1);
     EXPECT_TRUE(history_has("tavlolog already stopped, ignore this stop"));
     EXPECT_FALSE(history_has("tavlolog stop done"));
+}
+
+// A run held in /data while the card is gone: until the writer has ended it
+// checks /data, and a notice sent during the stop does not outlive it.
+TEST_F(RunTest, StopLeavesNoFalseOrStaleStorageNotice) {
+    strcpy(controller_.logpath, "/mnt/no_card");
+    controller_.log_path_state = 0;
+    start_logging(&controller_);
+    pid_t slow = fork();  // ignores the stop request: the stop waits its full second
+    if (slow == 0) {
+        signal(SIGUSR1, SIG_IGN);
+        pause();
+        _exit(0);
+    }
+    controller_.mlog_pid = slow;
+    controller_.shm->slots[SLOT_MAIN].exited = 0;
+    uint64_t notice = 1001;
+    ASSERT_EQ(write(efd_thread, &notice, sizeof(notice)), 8);
+    stop_logging(&controller_);
+    EXPECT_FALSE(history_has("no space to write log"));
+    EXPECT_EQ(read(efd_thread, &notice, sizeof(notice)), -1) << "a stale notice would stop the next run";
 }
 
 // A collector that ends with a reason is reported with it; the last one to end

@@ -176,3 +176,12 @@ struct RunBlock {
         if (fd >= 0) close(fd);
     }
 };
+
+// The phone's logger devices at /dev/log of this throwaway phone, started anew
+// with emu_logger's options (such as "--size 8192 --no-system"); true once
+// they serve.
+inline bool start_logger_devices(const std::string& options = "") {
+    std::string out;
+    run_shell("umount -l /dev/log 2>/dev/null; mkdir -p /dev/log", &out);
+    return run_shell("emu_logger " + options + " /dev/log", &out) == 0;
+}

@@ -14,6 +14,7 @@
 #include "transist/transist_queue.h"
 #include "transist/transist_state.h"
 #include "transist/transist_writer.h"
+#include "storage/storage_check.h"
 
 namespace {
 
@@ -206,6 +207,28 @@ TEST_F(TransistTest, LaterConnectionOfATypeTakesOverAfterTheEarlierOnesData) {
     EXPECT_TRUE(history_has("main_log connection replaced by a new one"));
 }
 
+// Only the daemon's own processes may feed "log_socket": another process is
+// closed at once, never displaces a collector and lands nothing in a file.
+TEST_F(TransistTest, ConnectionsOfOtherProcessesAreRefused) {
+    start();
+    int collector = connect_log_socket("Kreal\n");
+    pid_t child = fork();
+    if (child == 0) {
+        if (fork() == 0) {  // a grandchild: no child of this "daemon" once its parent is gone
+            while (getppid() != 1) usleep(1000);
+            int fd = connect_log_socket("Kforged\n");
+            _exit(closed_by_peer(fd, 5000) ? 0 : 1);
+        }
+        _exit(0);
+    }
+    ASSERT_TRUE(exits_with(child, 0));
+    ASSERT_TRUE(wait_for([] { return history_has("refuse log_socket client uid 0 pid "); }, 5000));
+    send_all(collector, "still real\n");
+    close(collector);
+    stop();
+    EXPECT_EQ(log("kernel_log"), kHeader + "real\nstill real\n");
+}
+
 TEST_F(TransistTest, CollectorEndIsRecordedAndTheTypeCanReconnect) {
     start();
     stream_log('R', "one\n");
@@ -283,6 +306,31 @@ TEST_F(TransistTest, BurstFasterThanTheIntervalIsWrittenEarlyWithBoundedMemory) 
     EXPECT_LE(peak, QUEUE_HIGH_WATER + 65535);
     stop();
     EXPECT_TRUE(log("kernel_log") == kHeader + data);
+}
+
+// An 11 MiB card: its free space shrinks as kernel_log grows.
+uint64_t small_card_free(const char*) {
+    struct stat st;
+    return (11 << 20) - static_cast<uint64_t>(stat("/data/run/kernel_log", &st) == 0 ? st.st_size : 0);
+}
+
+// One cycle carrying 8 MB must stop at the 10 MiB reserve, not after it.
+TEST_F(TransistTest, ReserveHoldsWhileACycleWrites) {
+    writer_free_space = small_card_free;
+    transist_controller = controller_;  // as a run's start sets it
+    rotate_limit_kb = 1 << 20;          // one file holds it all
+    open_output_files(controller_, kRun);
+    TransistQueue q = {};
+    std::string chunk(CHUNK_MAX, 'k');
+    for (int i = 0; i < (8 << 20) / CHUNK_MAX; i++) ASSERT_EQ(queue_append(&q, LOG_KERNEL, chunk.data(), CHUNK_MAX, 65535), 1);
+    pthread_mutex_lock(&file_table_lock);
+    EXPECT_EQ(flush_one_queue(&q, false), FLUSH_STORAGE_LOW);
+    close_all_log_files();
+    pthread_mutex_unlock(&file_table_lock);
+    EXPECT_GE(small_card_free("/data") + 65535, LOW_STORAGE_BYTES) << "below the reserve by more than a node";
+    EXPECT_GT(q.total, 0) << "what did not fit stays queued";
+    queue_clear(&q);
+    writer_free_space = [](const char* path) { return get_free_space(path, 0); };
 }
 
 std::string checked_path;

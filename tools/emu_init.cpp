@@ -4,7 +4,9 @@
 // stored persist. properties, and keeps the daemon running: it starts
 // /system/bin/tavlo_log_d as root, restarts it when it ends (no sooner than
 // 5 s after its previous start, as a phone's init), and reaps every orphan.
-// SIGTERM powers the phone off.
+// Before the daemon it starts the phone's logger devices at /dev/log and the
+// Bluetooth stack's log service (unless the boot left them out). SIGTERM
+// powers the phone off.
 #include <dirent.h>
 #include <errno.h>
 #include <fcntl.h>
@@ -254,6 +256,50 @@ static void start_ext_sdcard_tool(const sigset_t* old_mask) {
     if (pid < 0) init_log("cannot start %s: %s", kExtSdcardTool, strerror(errno));
 }
 
+// The Bluetooth log service's feed is a FIFO the host writes into. Held open
+// for writing, it never shows its reader an end, and the host's writes wait in
+// it while the service is down.
+static int hold_btlog_feed() {
+    struct stat st;
+    if (stat("/dev/emu/btlog", &st) != 0 || !S_ISFIFO(st.st_mode)) return -1;
+    int fd = RETRY_EINTR(open("/dev/emu/btlog", O_RDWR | O_NONBLOCK | O_CLOEXEC));
+    if (fd < 0) {
+        init_log("cannot hold /dev/emu/btlog: %s", strerror(errno));
+        return -1;
+    }
+    fcntl(fd, F_SETPIPE_SZ, 1 << 20);
+    return fd;
+}
+
+// The boot's choices come from tavlo-emu through the environment.
+static bool boot_flag(const char* name) {
+    const char* value = getenv(name);
+    return value != nullptr && strcmp(value, "1") == 0;
+}
+
+// The logger devices, each of EMU_LOGGER_SIZE bytes (default 256 KiB), without
+// /dev/log/system when EMU_NO_SYSTEM_LOG=1. emu_logger returns once they serve.
+static void start_logger_devices() {
+    prepare_dir("/dev/log", 0755, AID_ROOT, AID_ROOT);
+    const char* size = getenv("EMU_LOGGER_SIZE");
+    const char* argv[8] = {"/system/bin/emu_logger"};
+    int argc = 1;
+    if (size != nullptr && *size != '\0') {
+        argv[argc++] = "--size";
+        argv[argc++] = size;
+    }
+    if (boot_flag("EMU_NO_SYSTEM_LOG")) argv[argc++] = "--no-system";
+    argv[argc++] = "/dev/log";
+    argv[argc] = nullptr;
+    if (run_tool(argv) != 0) init_log("the logger devices do not serve (see console.log)");
+}
+
+static void start_btlog_service() {
+    if (boot_flag("EMU_NO_BTLOG")) return;
+    const char* const argv[] = {"/system/bin/emu_btlog", "start", nullptr};
+    if (run_tool(argv) != 0) init_log("the Bluetooth log service does not serve (see console.log)");
+}
+
 static void write_daemon_pid(pid_t pid) {
     // Written aside and renamed so that a reader never sees half a number.
     char tmp[PATH_LEN];
@@ -361,6 +407,10 @@ int main() {
     load_persistent_properties();
     int kmsg_fd = hold_kmsg();
     (void)kmsg_fd;  // held until power-off
+    int btlog_fd = hold_btlog_feed();
+    (void)btlog_fd;  // held until power-off
+    start_logger_devices();
+    start_btlog_service();
 
     sigset_t mask;
     sigset_t old_mask;

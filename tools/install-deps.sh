@@ -3,7 +3,7 @@
 # Idempotent: does nothing when everything is there.
 set -eu
 pkgs=(build-essential cmake ninja-build pkg-config bubblewrap util-linux procps
-      libgtest-dev libgmock-dev android-liblog-dev android-libcutils-dev)
+      libgtest-dev libgmock-dev android-liblog-dev android-libcutils-dev libfuse3-dev fuse3)
 missing=()
 for p in "${pkgs[@]}"; do
     dpkg-query -W -f='${Status}' "$p" 2>/dev/null | grep -q "install ok installed" || missing+=("$p")

@@ -9,10 +9,12 @@
 #include <unistd.h>
 
 #include "common/io_util.h"
+#include "common/unique_fd.h"
 #include "common/wlog.h"
 #include "core/log_controller.h"
 #include "platform/properties.h"
 #include "storage/history_log.h"
+#include "storage/safe_file.h"
 #include "transist/transist_queue.h"
 #include "transist/transist_state.h"
 
@@ -20,6 +22,36 @@ static const char HEADER_PREFIX[] = "-----timezone: ";
 
 // One record per file for failed data writes: a full disk fails every node.
 static bool write_failure_recorded[LOG_TYPE_COUNT];
+
+// The controller's log path when the files were opened: a folder below it is
+// trusted from there on, one in /data from "/data" (trusted_root_for); below
+// that nothing is opened through a link. file_table_lock.
+static char log_root[PATH_LEN];
+
+static void take_log_root() {
+    copy_str(log_root, sizeof(log_root), transist_controller ? transist_controller->logpath : "");
+}
+
+// Opens the folder of path (which ends in a file name) and puts the file
+// name's offset into *name_at.
+static int open_folder_of(const char* path, size_t* name_at) {
+    const char* slash = strrchr(path, '/');
+    if (slash == nullptr) {
+        errno = EINVAL;
+        return -1;
+    }
+    char folder[PATH_LEN];
+    *name_at = static_cast<size_t>(slash - path) + 1;
+    memcpy(folder, path, *name_at);
+    folder[*name_at] = '\0';
+    char parent[PATH_LEN];
+    const char* root = trusted_root_for(folder, log_root, parent);
+    if (root == nullptr) {
+        errno = EINVAL;
+        return -1;
+    }
+    return safe_open_dir(root, folder, false, 0);
+}
 
 // Forgets a file's recorded write failure; entries outside the table have none.
 static void reset_write_failure(const LogFile* entry) {
@@ -55,10 +87,11 @@ int format_header(char* out, size_t n, const char* timezone) {
     return len < static_cast<int>(n) ? len : static_cast<int>(n) - 1;
 }
 
-int open_log_file(const char* path) {
-    // O_CLOEXEC keeps the files out of the shell commands the daemon runs; the
-    // forked collectors close their copies themselves.
-    int fd = RETRY_EINTR(open(path, O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0600));
+// Opens name in the folder dirfd for appending and writes the header.
+static int open_in_folder(int dirfd, const char* name, const char* path) {
+    // O_CLOEXEC (the helper's) keeps the files out of the shell commands the
+    // daemon runs; the forked collectors close their copies themselves.
+    int fd = safe_open_file(dirfd, name, SAFE_APPEND, 0600);
     if (fd < 0) return fd;
     if (fd == 0) {
         // Descriptor 0 counts as "no file" in the table; move it out of the way.
@@ -83,6 +116,13 @@ int open_log_file(const char* path) {
     return fd;
 }
 
+int open_log_file(const char* path) {
+    size_t name_at = 0;
+    UniqueFd dir(open_folder_of(path, &name_at));
+    if (!dir.ok()) return -1;
+    return open_in_folder(dir.get(), path + name_at, path);
+}
+
 int compose_log_name(char* out, const char* folder, int type) {
     int len = snprintf(out, PATH_LEN, "%s%s", folder, log_type_name(type));
     if (len < 0 || len >= PATH_LEN) {
@@ -97,6 +137,7 @@ void open_output_files(LogController* controller, const char* run_folder) {
                                     controller->android_log != 0, controller->kernel_log != 0,
                                     controller->bt_log != 0};
     pthread_mutex_lock(&file_table_lock);
+    take_log_root();
     for (int type = 0; type < LOG_TYPE_COUNT; type++) {
         log_files[type].fd = -1;
         log_files[type].size = 0;
@@ -184,19 +225,26 @@ void sync_retired_files() {
 
 int rotate_log_files(LogFile* entry) {
     retire_log_file(entry);
+    // Renamed and reopened from the folder's descriptor: a link planted in
+    // the folder's path since it was opened is not followed.
+    size_t name_at = 0;
+    UniqueFd dir(open_folder_of(entry->name, &name_at));
+    const char* name = entry->name + name_at;
     char from[PATH_LEN + 8];
     char to[PATH_LEN + 8];
-    for (int i = 4; i >= 1; i--) {
+    for (int i = 4; dir.ok() && i >= 1; i--) {
         if (i == 1) {
-            snprintf(from, sizeof(from), "%s", entry->name);
+            snprintf(from, sizeof(from), "%s", name);
         } else {
-            snprintf(from, sizeof(from), "%s.%d", entry->name, i - 1);
+            snprintf(from, sizeof(from), "%s.%d", name, i - 1);
         }
-        snprintf(to, sizeof(to), "%s.%d", entry->name, i);
+        snprintf(to, sizeof(to), "%s.%d", name, i);
         // A generation that does not exist yet is normal.
-        if (rename(from, to) != 0 && errno != ENOENT) perror("while rotating log files");
+        if (renameat(dir.get(), from, dir.get(), to) != 0 && errno != ENOENT) {
+            perror("while rotating log files");
+        }
     }
-    entry->fd = open_log_file(entry->name);
+    entry->fd = dir.ok() ? open_in_folder(dir.get(), name, entry->name) : -1;
     entry->size = 0;
     reset_write_failure(entry);
     if (entry->fd < 0) {
@@ -220,6 +268,7 @@ void close_all_log_files() {
 
 void change_log_folder(const char* new_folder, int new_rotate_kb) {
     pthread_mutex_lock(&file_table_lock);
+    take_log_root();
     for (int type = 0; type < LOG_TYPE_COUNT; type++) {
         LogFile* entry = &log_files[type];
         if (entry->fd <= 0) continue;

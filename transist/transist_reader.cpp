@@ -11,6 +11,7 @@
 
 #include "common/io_util.h"
 #include "common/wlog.h"
+#include "core/peer_auth.h"
 #include "storage/history_log.h"
 #include "transist/transist.h"
 #include "transist/transist_queue.h"
@@ -166,6 +167,10 @@ static void accept_connections() {
             struct pollfd wake = {reader_wake_fd, POLLIN, 0};
             if (!stop_requested) RETRY_EINTR(poll(&wake, 1, 1000));
             return;
+        }
+        if (!log_peer_allowed(fd)) {
+            close(fd);
+            continue;
         }
         int slot = -1;
         for (int i = 0; i < MAX_PENDING; i++) {
@@ -355,6 +360,7 @@ void* read_thread(void*) {
             handle_ready(&set, 1);
         }
         expire_pending(monotonic_us());
+        peer_records_flush();
     }
 
     drain_at_stop();

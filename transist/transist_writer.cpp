@@ -35,8 +35,37 @@ int writer_storage_blocked(LogController* controller, int (*is_low)(const char*)
     return 1;
 }
 
+static uint64_t measure_free_space(const char* path) { return get_free_space(path, 0); }
+uint64_t (*writer_free_space)(const char* path) = measure_free_space;
+
+// Free space is measured again after this many bytes at most, and before
+// every node once less than that is left above the reserve.
+constexpr int64_t SPACE_RECHECK_BYTES = 1 << 20;
+
+// Bytes a flush may still write before it measures the free space again;
+// negative until the first measurement.
+struct SpaceBudget {
+    int64_t bytes = -1;
+};
+
+// The reserve has to hold while a cycle writes, not only when it begins: one
+// cycle may carry megabytes. A node is written while the last measurement
+// left room above the reserve, so the reserve is crossed by one node at most.
+static bool room_for_node(SpaceBudget* budget, const char* path, int len) {
+    if (budget->bytes <= 0) {
+        uint64_t free_bytes = writer_free_space(path);
+        if (is_free_space_low(free_bytes)) return false;
+        uint64_t above = free_bytes - LOW_STORAGE_BYTES;
+        budget->bytes = above < static_cast<uint64_t>(SPACE_RECHECK_BYTES) ? static_cast<int64_t>(above)
+                                                                           : SPACE_RECHECK_BYTES;
+    }
+    budget->bytes -= len;
+    return true;
+}
+
 int flush_one_queue(TransistQueue* q, bool notify) {
     int written = 0;
+    SpaceBudget budget;
     for (int type = 0; type < LOG_TYPE_COUNT; type++) {
         LogFile* entry = &log_files[type];
         BufferList* list = &q->lists[type];
@@ -60,6 +89,18 @@ int flush_one_queue(TransistQueue* q, bool notify) {
                 return FLUSH_FOLDER_LOST;
             }
             LogBuffer* node = list->head;
+            // The same root as the check at the start of a cycle; the
+            // controller resets it only after the writer has ended.
+            const char* root = transist_controller ? transist_controller->current_log_root() : entry->name;
+            if (!room_for_node(&budget, root, node->len)) {
+                HLOG(TAG_UTIL, WLOG_ERROR, "%s is almost full or unavailable!!", root);
+                HLOG(TAG_TRANSIST, WLOG_ERROR, "no space to write log");
+                if (notify) {
+                    reply_client(transist_controller, -1, "storage_full");
+                    notify_controller(EVENT_STORAGE_LOW);
+                }
+                return FLUSH_STORAGE_LOW;
+            }
             written += write_log_data(type, node->buf, node->len);
             // The node leaves the queue whether or not the disk took it all.
             q->total -= node->len;
@@ -87,34 +128,21 @@ static void close_files_only() {
     pthread_mutex_unlock(&file_table_lock);
 }
 
-// The storage gate at a stop looks at the files' own file system: the
-// controller's log root may already have been reset by then.
-// A file that is gone is left to the flush, which reports the lost folder.
-static int files_storage_low() {
-    for (const LogFile& entry : log_files) {
-        if (entry.fd > 0 && access(entry.name, F_OK) == 0) return is_storage_low(entry.name);
-    }
-    return 0;
-}
-
 static int finish_at_stop() {
     if (!wait_reader_done(STOP_DRAIN_MS + 200)) {
         HLOG(TAG_TRANSIST, WLOG_WARN, "reader still busy at stop, writing what is queued");
     }
     int rc = 0;
     pthread_mutex_lock(&file_table_lock);
-    if (files_storage_low()) {
-        HLOG(TAG_TRANSIST, WLOG_ERROR, "no space to write log");
-    } else {
-        // Oldest first: the spare queue was drained a cycle before the drain
-        // queue, which was filled before the fill queue.
-        pthread_mutex_lock(&queue_lock);
-        TransistQueue* order[QUEUE_COUNT] = {spare_queue, drain_queue, fill_queue};
-        pthread_mutex_unlock(&queue_lock);
-        for (TransistQueue* q : order) {
-            rc = flush_one_queue(q, false);
-            if (rc < 0) break;
-        }
+    // Oldest first: the spare queue was drained a cycle before the drain
+    // queue, which was filled before the fill queue. The flush keeps the
+    // reserve of the run's log root.
+    pthread_mutex_lock(&queue_lock);
+    TransistQueue* order[QUEUE_COUNT] = {spare_queue, drain_queue, fill_queue};
+    pthread_mutex_unlock(&queue_lock);
+    for (TransistQueue* q : order) {
+        rc = flush_one_queue(q, false);
+        if (rc < 0) break;
     }
     close_all_log_files();
     pthread_mutex_unlock(&file_table_lock);

@@ -20,10 +20,17 @@ int writer_storage_blocked(LogController* controller, int (*is_low)(const char*)
 // Caller holds file_table_lock. Returns the bytes written; FLUSH_FOLDER_LOST
 // when a file had disappeared (recorded; with notify, "log_folder_lost" to the
 // clients and 1002 to efd_thread), FLUSH_REOPEN_FAILED when a rotated file
-// could not be reopened. Unwritten nodes stay in q.
+// could not be reopened, FLUSH_STORAGE_LOW when the files' file system came
+// down to the 10 MiB reserve (recorded; with notify, "storage_full" and
+// 1001). Unwritten nodes stay in q.
 constexpr int FLUSH_FOLDER_LOST = -1;
 constexpr int FLUSH_REOPEN_FAILED = -2;
+constexpr int FLUSH_STORAGE_LOW = -3;
 int flush_one_queue(TransistQueue* q, bool notify);
+
+// Free bytes of the file system of a log file (get_free_space); tests put a
+// model of a small card here.
+extern uint64_t (*writer_free_space)(const char* path);
 
 // flush_one_queue of the drain queue under file_table_lock.
 int flush_queue();

@@ -257,6 +257,12 @@ bool EmuPhone::boot(const BootOptions& options) {
         args.push_back("--data-size");
         args.push_back(std::to_string(options.data_mb));
     }
+    if (!options.system_log) args.push_back("--no-system-log");
+    if (!options.btlog) args.push_back("--no-btlog");
+    if (options.logger_kb > 0) {
+        args.push_back("--logger-size");
+        args.push_back(std::to_string(options.logger_kb));
+    }
     if (!options.ext_sdcard.empty()) {
         args.push_back("--ext-sdcard");
         args.push_back(options.ext_sdcard);
@@ -392,11 +398,15 @@ bool EmuPhone::file_exists(const std::string& device_path) const {
     return !path.empty() && lstat(path.c_str(), &st) == 0;
 }
 
-bool EmuPhone::write_kmsg(const std::string& bytes, int timeout_ms) {
+bool EmuPhone::write_kmsg(const std::string& bytes, int timeout_ms) { return write_feed("kmsg", bytes, timeout_ms); }
+
+bool EmuPhone::write_btlog(const std::string& bytes, int timeout_ms) { return write_feed("btlog", bytes, timeout_ms); }
+
+bool EmuPhone::write_feed(const char* fifo, const std::string& bytes, int timeout_ms) {
     if (!running()) return false;
     // Non-blocking: without the phone's init holding the FIFO, open fails at
     // once instead of waiting for a reader forever.
-    int fd = open((dir_ + "/.emu/kmsg").c_str(), O_WRONLY | O_NONBLOCK | O_CLOEXEC);
+    int fd = open((dir_ + "/.emu/" + fifo).c_str(), O_WRONLY | O_NONBLOCK | O_CLOEXEC);
     if (fd < 0) return false;
     size_t done = 0;
     long long deadline = now_ms() + timeout_ms;

@@ -23,6 +23,9 @@ struct BootOptions {
     bool real_kmsg = false;               // the host kernel's /proc/kmsg instead of the FIFO
     std::string ext_sdcard;               // steps of the kelm boot's storage tool ("after 3 link")
     std::vector<std::string> build_prop;  // lines added to /system/build.prop (later ones win)
+    bool system_log = true;               // false: no /dev/log/system
+    bool btlog = true;                    // false: no Bluetooth log service at boot
+    int logger_kb = 0;                    // > 0: size of each logger buffer
 };
 
 // A process running inside the phone, with its stdin and stdout connected to
@@ -91,6 +94,8 @@ class EmuPhone {
     // Feeds bytes to the phone's /proc/kmsg; false when not booted or the
     // FIFO stays full for timeout_ms.
     bool write_kmsg(const std::string& bytes, int timeout_ms = 5000);
+    // Feeds bytes to the Bluetooth log service (they wait while it is down).
+    bool write_btlog(const std::string& bytes, int timeout_ms = 5000);
 
     pid_t daemon_pid() const;     // inside the phone; -1 when none runs
     pid_t host_init_pid() const;  // host pid of the phone's init; -1 when off
@@ -102,6 +107,7 @@ class EmuPhone {
 
   private:
     int run_emu(const std::vector<std::string>& args);
+    bool write_feed(const char* fifo, const std::string& bytes, int timeout_ms);
 
     std::string dir_;
     BootOptions options_;

@@ -118,7 +118,8 @@ TEST(EmulatorTest, StopLeavesNothingRunning) {
     ASSERT_GT(init, 0);
     std::string ns = read_link("/proc/" + std::to_string(init) + "/ns/pid");
     ASSERT_FALSE(ns.empty());
-    auto sleeper = phone.spawn({"sleep", "1000"});
+    // A reader blocked on a logger device must not hold the power-off up.
+    auto sleeper = phone.spawn({"cat", "/dev/log/main"});
     ASSERT_TRUE(sleeper);
     ASSERT_TRUE(EmuPhone::wait_for([&] { return processes_in_pid_namespace(ns) >= 3; }, 5000));
 
@@ -131,6 +132,25 @@ TEST(EmulatorTest, StopLeavesNothingRunning) {
     mounts << std::ifstream("/proc/self/mountinfo").rdbuf();
     EXPECT_EQ(std::string::npos, mounts.str().find(phone.image_dir()));
     EXPECT_NE(0, phone.exec({"true"}));
+}
+
+// The defaults are what every other phone boots with.
+TEST(EmulatorTest, BootOptionsShapeTheLoggerDevicesAndBluetoothService) {
+    EmuPhone phone;
+    BootOptions options;
+    options.system_log = false;
+    options.btlog = false;
+    options.logger_kb = 4;
+    ASSERT_TRUE(phone.boot(options));
+    std::string out;
+    EXPECT_NE(0, phone.exec({"test", "-e", "/dev/log/system"}));
+    EXPECT_EQ(0, phone.exec({"cat", "/proc/net/unix"}, &out));
+    EXPECT_EQ(std::string::npos, out.find("@btlog"));
+    // Of two 3016-byte entries a 4 KB buffer keeps one; dd ends with EAGAIN.
+    std::string text(2990, 'x');
+    ASSERT_EQ(0, phone.exec({"sh", "-c", "log " + text + " && log " + text}));
+    phone.exec({"sh", "-c", "dd if=/dev/log/main of=/dev/null bs=5120 iflag=nonblock 2>&1"}, &out);
+    EXPECT_NE(std::string::npos, out.find("3016 bytes")) << out;
 }
 
 TEST(EmulatorTest, RebootKeepsPersistentPropertiesAndData) {

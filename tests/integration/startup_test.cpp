@@ -162,18 +162,33 @@ TEST(Startup, AsAnotherUserRecordsItAndGoesOn) {
     EmuPhone phone;
     ASSERT_TRUE(phone.boot());
     // A second daemon, started as the shell user: it records that it is not root,
-    // goes on to the banner and the boot mode, then finds "tavlologd" taken.
-    std::string out;
-    int rc = phone.exec({"setpriv", "--reuid", "2000", "--regid", "1000", "--clear-groups",
-                         "/system/bin/tavlo_log_d"},
-                        &out, "", 20000);
-    EXPECT_NE(rc, 0);
+    // goes on to the banner and the boot mode, then finds "tavlologd" taken and waits for it.
+    auto second = phone.spawn({"setpriv", "--reuid", "2000", "--regid", "1000", "--clear-groups",
+                               "/system/bin/tavlo_log_d"});
+    EXPECT_TRUE(wait_history(phone, "create socket 'tavlologd' failed"));
     std::string history = phone.read_file(kHistory);
     EXPECT_TRUE(contains(history, "[== First Log ==] tavlo_log_d is not in root user")) << history;
     EXPECT_EQ(count(history, "****** TQLOG START *******"), 2);
-    EXPECT_TRUE(contains(history, "create socket 'tavlologd' failed")) << history;
     EXPECT_TRUE(contains(phone.read_file("/dev/emu/wlog"),
                          "TavloLogD/DEBUG: [== First Log ==] tavlo_log_d is not in root user"));
+    second->kill();
+}
+
+// A daemon killed during a run: the one init starts next neither sees a live
+// run nor writes into the dead run's folder.
+TEST(Startup, RestartForgetsTheDeadRun) {
+    EmuPhone phone;
+    ASSERT_TRUE(phone.boot());
+    ASSERT_TRUE(configure(phone, {"logpath=/data"}));
+    ASSERT_EQ(ctl(phone, {"start"}), 0);
+    std::string folder = run_folder(phone);
+    ASSERT_FALSE(folder.empty());
+    ASSERT_EQ(phone.exec({"kill", "-9", std::to_string(phone.daemon_pid())}), 0);
+    ASSERT_TRUE(wait_history(phone, "****** TQLOG START *******", 2));
+    ASSERT_TRUE(wait_history(phone, "boot:0,path:/data", 2));
+    EXPECT_EQ(phone.getprop("debug.TQ.realpath"), "");
+    EXPECT_EQ(phone.getprop("debug.TQ.running"), "0");
+    EXPECT_FALSE(contains(phone.read_file(folder + "tqlog_history"), "boot:0,path:/data"));
 }
 
 }  // namespace
