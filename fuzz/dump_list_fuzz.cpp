@@ -3,15 +3,12 @@
 // through parse_dump_list_text, each result checked against a small model.
 //
 //   dump_list_fuzz [SECONDS [SEED]]   (or TAVLO_FUZZ_SECONDS, TAVLO_FUZZ_SEED)
-#include <stdio.h>
-#include <stdlib.h>
-#include <time.h>
-#include <unistd.h>
 
 #include <random>
 #include <string>
 #include <vector>
 
+#include "fuzz/fuzz_util.h"
 #include "storage/debug_dump.h"
 
 namespace {
@@ -61,15 +58,13 @@ std::vector<std::string> model(const std::string& text, const std::string& run) 
 }  // namespace
 
 int main(int argc, char** argv) {
-    double seconds = argc > 1 ? atof(argv[1]) : getenv("TAVLO_FUZZ_SECONDS") ? atof(getenv("TAVLO_FUZZ_SECONDS")) : 10;
-    unsigned long seed = argc > 2 ? strtoul(argv[2], nullptr, 0)
-                                  : getenv("TAVLO_FUZZ_SEED") ? strtoul(getenv("TAVLO_FUZZ_SEED"), nullptr, 0) : 0xd0f11e;
-    printf("dump_list_fuzz: seed %lu, %.1f s\n", seed, seconds);
-    fflush(stdout);
+    double seconds = 10;
+    unsigned long seed = 0xd0f11e;
+    fuzz_start("dump_list_fuzz", argc, argv, &seconds, &seed);
     rng.seed(seed);
-    time_t deadline = time(nullptr) + static_cast<time_t>(seconds);
+    double deadline = fuzz_now() + seconds;
     unsigned long i = 0;
-    for (; time(nullptr) < deadline; i++) {
+    for (; fuzz_now() < deadline; i++) {
         std::string text = random_list();
         std::string run = "/mnt/sdcard/" + std::string(pick(250), 'r') + "/";
         std::vector<std::string> got;
@@ -81,12 +76,10 @@ int main(int argc, char** argv) {
             e = next;
         }
         if (got != model(text, run)) {
-            fprintf(stderr, "dump_list_fuzz: FAILED at iteration %lu (seed %lu): %zu entries, model %zu\n", i, seed,
-                    got.size(), model(text, run).size());
+            fprintf(stderr, "dump_list_fuzz: FAILED at iteration %lu (seed %lu): %zu entries, model %zu\nlist: \"%s\"\n",
+                    i, seed, got.size(), model(text, run).size(), fuzz_printable(text).c_str());
             abort();
         }
-        // Refused lines are recorded; keep the history from filling the image.
-        if (i % 4096 == 0) unlink("/data/misc/tqlog/tqlog_history");
     }
     printf("dump_list_fuzz: %lu lists, no failure\n", i);
     return 0;

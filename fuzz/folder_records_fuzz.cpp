@@ -4,16 +4,14 @@
 //
 //   folder_records_fuzz [SECONDS [SEED]]   (or TAVLO_FUZZ_SECONDS, TAVLO_FUZZ_SEED)
 #include <limits.h>
-#include <stdio.h>
 #include <stdlib.h>
 #include <sys/stat.h>
-#include <time.h>
-#include <unistd.h>
 
 #include <random>
 #include <string>
 #include <vector>
 
+#include "fuzz/fuzz_util.h"
 #include "storage/folder_records.h"
 
 namespace {
@@ -65,16 +63,14 @@ std::vector<std::string> model(const std::string& text) {
 }  // namespace
 
 int main(int argc, char** argv) {
-    double seconds = argc > 1 ? atof(argv[1]) : getenv("TAVLO_FUZZ_SECONDS") ? atof(getenv("TAVLO_FUZZ_SECONDS")) : 10;
-    unsigned long seed = argc > 2 ? strtoul(argv[2], nullptr, 0)
-                                  : getenv("TAVLO_FUZZ_SEED") ? strtoul(getenv("TAVLO_FUZZ_SEED"), nullptr, 0) : 0xf01de2;
-    printf("folder_records_fuzz: seed %lu, %.1f s\n", seed, seconds);
-    fflush(stdout);
+    double seconds = 10;
+    unsigned long seed = 0xf01de2;
+    fuzz_start("folder_records_fuzz", argc, argv, &seconds, &seed);
     rng.seed(seed);
     mkdir("/data/misc", 0771);
-    time_t deadline = time(nullptr) + static_cast<time_t>(seconds);
+    double deadline = fuzz_now() + seconds;
     unsigned long i = 0;
-    for (; time(nullptr) < deadline; i++) {
+    for (; fuzz_now() < deadline; i++) {
         std::string text = random_records();
         FolderRecord* list = parse_folder_records(text.data(), text.size());
         bool written = i % 16 == 0 && write_folder_records(list, "NEW", 1) == 1;
@@ -84,12 +80,10 @@ int main(int argc, char** argv) {
             got = listed(read_folder_records(1));
         }
         if (got != expected) {
-            fprintf(stderr, "folder_records_fuzz: FAILED at iteration %lu (seed %lu): %zu records, model %zu\n", i,
-                    seed, got.size(), expected.size());
+            fprintf(stderr, "folder_records_fuzz: FAILED at iteration %lu (seed %lu): %zu records, model %zu\nfile: \"%s\"\n",
+                    i, seed, got.size(), expected.size(), fuzz_printable(text).c_str());
             abort();
         }
-        // Malformed lines are recorded; keep the history from filling the image.
-        if (i % 4096 == 0) unlink("/data/misc/tqlog/tqlog_history");
     }
     printf("folder_records_fuzz: %lu record files, no failure\n", i);
     return 0;
