@@ -11,7 +11,7 @@
 // (c) the kernel collector's path from a FIFO standing in for /proc/kmsg (to come).
 //
 // Generations that rotation would delete (X.4 replaced) are kept aside by a
-// rename() hook below, so that the check sees every byte ever written.
+// renameat() hook below, so that the check sees every byte ever written.
 #include <errno.h>
 #include <fcntl.h>
 #include <pthread.h>
@@ -22,6 +22,7 @@
 #include <sys/socket.h>
 #include <sys/ioctl.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <time.h>
 #include <unistd.h>
 
@@ -332,12 +333,17 @@ void print_row(const char* what, long total, const Result& r) {
 }  // namespace
 
 // Keeps the generation that a rotation is about to delete (the rename onto
-// X.4), so that the content check can see every byte. The transist's renames
-// resolve to this definition in this program only.
-extern "C" int rename(const char* from, const char* to) {
+// X.4), so that the content check can see every byte. The transist renames
+// within the run folder's descriptor; its calls resolve to this definition in
+// this program only, which renames with the system call itself.
+extern "C" int renameat(int from_dir, const char* from, int to_dir, const char* to) {
     size_t n = strlen(to);
-    if (n > 2 && strcmp(to + n - 2, ".4") == 0 && access(to, F_OK) == 0) {
-        std::string base(to, n - 2);
+    if (n > 2 && strcmp(to + n - 2, ".4") == 0 && faccessat(to_dir, to, F_OK, 0) == 0) {
+        char link[32], folder[PATH_LEN];
+        snprintf(link, sizeof(link), "/proc/self/fd/%d", to_dir);
+        ssize_t len = to_dir == AT_FDCWD ? -1 : readlink(link, folder, sizeof(folder) - 1);
+        folder[len > 0 ? len : 0] = '\0';
+        std::string base = (len > 0 ? std::string(folder) + "/" : std::string()) + std::string(to, n - 2);
         int seq;
         {
             std::lock_guard<std::mutex> hold(gone_lock);
@@ -345,9 +351,9 @@ extern "C" int rename(const char* from, const char* to) {
         }
         char kept[PATH_LEN + 32];
         snprintf(kept, sizeof(kept), "%s.gone.%06d", base.c_str(), seq);
-        renameat(AT_FDCWD, to, AT_FDCWD, kept);
+        syscall(SYS_renameat2, to_dir, to, AT_FDCWD, kept, 0);
     }
-    return renameat(AT_FDCWD, from, AT_FDCWD, to);
+    return static_cast<int>(syscall(SYS_renameat2, from_dir, from, to_dir, to, 0));
 }
 
 int main(int argc, char** argv) {
