@@ -21,6 +21,7 @@
 #include "transist/transist.h"
 
 CollectorLink* volatile current_collector = nullptr;
+volatile sig_atomic_t stop_signalled = 0;
 pid_t collector_daemon_pid = 0;
 unsigned int connect_retry_us = 1000000;
 
@@ -191,8 +192,8 @@ int send_to_transist(const char* buf, size_t len, int fd) {
     return static_cast<int>(len);
 }
 
-void check_stop(CollectorLink* collector) {
-    if (collector->shm == nullptr) return;
+bool stop_asked(CollectorLink* collector) {
+    if (collector->shm == nullptr) return false;
     // The stop handler takes the semaphore too: it must not run while this
     // process holds it.
     sigset_t old;
@@ -201,7 +202,11 @@ void check_stop(CollectorLink* collector) {
     int stop = __atomic_load_n(&control_stop(collector->shm), __ATOMIC_SEQ_CST);
     if (locked) control_block_unlock(collector->sem);
     pthread_sigmask(SIG_SETMASK, &old, nullptr);
-    if (stop != 0) exit_collector(collector, 0, REASON_NONE);
+    return stop != 0;
+}
+
+void check_stop(CollectorLink* collector) {
+    if (stop_asked(collector)) exit_collector(collector, 0, REASON_NONE);
 }
 
 // A collector ends with _exit, never exit: it is a forked copy of the
@@ -231,7 +236,14 @@ void exit_collector(CollectorLink* collector, int status, int reason) {
     _exit(status);
 }
 
-void on_stop_signal(int) { exit_collector(current_collector, 0, REASON_SIGNAL); }
+void on_stop_signal(int) {
+    CollectorLink* collector = current_collector;
+    if (collector != nullptr && collector->defer_stop_signal) {
+        stop_signalled = 1;
+        return;
+    }
+    exit_collector(collector, 0, REASON_SIGNAL);
+}
 
 void hold_stop_signal(sigset_t* wait_mask) {
     sigset_t old;

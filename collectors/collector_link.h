@@ -27,7 +27,14 @@ class CollectorLink {
     sem_t* sem = nullptr;         // null until opened
     const char log_type;          // stream letter: "M", "R", "E", "K" or "B"
     int transist_fd = -1;         // connection to "log_socket"
+    // Set by a collector that holds data it must still send when asked to
+    // stop: the stop signal then only sets stop_signalled, and the collector
+    // ends itself once it has sent what it holds.
+    bool defer_stop_signal = false;
 };
+
+// The stop signal arrived while defer_stop_signal was set.
+extern volatile sig_atomic_t stop_signalled;
 
 // The running collector of this process, for the stop-signal handler.
 extern CollectorLink* volatile current_collector;
@@ -55,6 +62,9 @@ int connect_transist(CollectorLink* collector);
 // failed before everything was written.
 int send_to_transist(const char* buf, size_t len, int fd);
 
+// True when the run asked its collectors to stop (the block's stop word).
+bool stop_asked(CollectorLink* collector);
+
 // Ends the collector (status 0, reason kept) when the run asked it to stop.
 void check_stop(CollectorLink* collector);
 
@@ -62,7 +72,7 @@ void check_stop(CollectorLink* collector);
 // the process with status.
 [[noreturn]] void exit_collector(CollectorLink* collector, int status, int reason);
 
-// SIGUSR1: end with status 0 and REASON_SIGNAL.
+// SIGUSR1: end with status 0 and REASON_SIGNAL (or, deferred, only note it).
 void on_stop_signal(int sig);
 
 // Keeps SIGUSR1 blocked from now on and stores in wait_mask the mask to wait

@@ -8,7 +8,9 @@
 #include <unistd.h>
 
 #include "collectors/collector_link.h"
+#include "collectors/bt_cat.h"
 #include "collectors/kmsg_cat.h"
+#include "collectors/log_cat.h"
 #include "common/log_types.h"
 #include "common/wlog.h"
 #include "core/log_controller.h"
@@ -51,22 +53,98 @@ static void collector_child_setup(LogController* controller) {
     sigprocmask(SIG_SETMASK, &none, nullptr);
 }
 
-int fork_kernel_log(LogController* controller, int block_fd) {
+// Forks a collector child that runs body; in the parent returns the child's
+// pid, or -1 (errno set) when fork failed. The child never returns.
+static pid_t fork_collector(LogController* controller, void (*body)(int shm_fd), int block_fd) {
     pid_t pid = fork();
+    if (pid == 0) {
+        collector_child_setup(controller);
+        body(block_fd);
+        _exit(0);  // see exit_collector
+    }
+    return pid;
+}
+
+static void run_kernel_log(int block_fd) {
+    KmsgCat collector;
+    collector.run(log_type_name(LOG_KERNEL), block_fd);
+    WLOG(TAG_MAIN, WLOG_DEBUG, "kernel log exits");
+}
+
+static void run_main_log(int block_fd) {
+    LogCat collector(log_type_name(LOG_MAIN));
+    collector.run(log_type_name(LOG_MAIN), nullptr, block_fd);
+}
+
+static void run_radio_log(int block_fd) {
+    LogCat collector(log_type_name(LOG_RADIO));
+    collector.run(log_type_name(LOG_RADIO), "radio", block_fd);
+}
+
+static void run_events_log(int block_fd) {
+    LogCat collector(log_type_name(LOG_EVENTS));
+    collector.run(log_type_name(LOG_EVENTS), "events", block_fd);
+}
+
+static void run_bt_log(int block_fd) {
+    BtCat collector;
+    collector.run(log_type_name(LOG_BT), block_fd);
+    WLOG(TAG_MAIN, WLOG_DEBUG, "BT log exits");
+}
+
+int fork_kernel_log(LogController* controller, int block_fd) {
+    pid_t pid = fork_collector(controller, run_kernel_log, block_fd);
     if (pid < 0) {
         int err = errno;
         HLOG(TAG_MAIN, WLOG_ERROR, "fork kLog failed");
         HLOG(TAG_MAIN, WLOG_ERROR, "fork kernelLog failed %s", strerror(err));
         return -1;
     }
-    if (pid == 0) {
-        collector_child_setup(controller);
-        KmsgCat collector;
-        collector.run(log_type_name(LOG_KERNEL), block_fd);
-        WLOG(TAG_MAIN, WLOG_DEBUG, "kernel log exits");
-        _exit(0);  // see exit_collector
-    }
     controller->klog_pid = pid;
     WLOG(TAG_MAIN, WLOG_DEBUG, "kmsgcat pid = %d", pid);
+    return 0;
+}
+
+int fork_main_log(LogController* controller, int block_fd) {
+    pid_t pid = fork_collector(controller, run_main_log, block_fd);
+    if (pid < 0) {
+        HLOG(TAG_MAIN, WLOG_ERROR, "fork mainLog failed %s", strerror(errno));
+        return -1;
+    }
+    controller->mlog_pid = pid;
+    WLOG(TAG_MAIN, WLOG_DEBUG, "logcat main pid = %d", pid);
+    return 0;
+}
+
+int fork_radio_log(LogController* controller, int block_fd) {
+    pid_t pid = fork_collector(controller, run_radio_log, block_fd);
+    if (pid < 0) {
+        HLOG(TAG_MAIN, WLOG_ERROR, "fork radiolog failed %s", strerror(errno));
+        return -1;
+    }
+    controller->rlog_pid = pid;
+    WLOG(TAG_MAIN, WLOG_DEBUG, "logcat radio pid = %d", pid);
+    return 0;
+}
+
+int fork_events_log(LogController* controller, int block_fd) {
+    pid_t pid = fork_collector(controller, run_events_log, block_fd);
+    if (pid < 0) {
+        HLOG(TAG_MAIN, WLOG_ERROR, "fork eventsLog failed %s", strerror(errno));
+        return -1;
+    }
+    controller->elog_pid = pid;
+    WLOG(TAG_MAIN, WLOG_DEBUG, "logcat events pid = %d", pid);
+    return 0;
+}
+
+int fork_bt_log(LogController* controller, int block_fd) {
+    pid_t pid = fork_collector(controller, run_bt_log, block_fd);
+    if (pid < 0) {
+        HLOG(TAG_MAIN, WLOG_ERROR, "fork btLog failed %s", strerror(errno));
+        return -1;
+    }
+    controller->blog_pid = pid;
+    WLOG(TAG_MAIN, WLOG_DEBUG, "btcat pid = %d", pid);
     return 0;
 }

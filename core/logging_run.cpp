@@ -181,21 +181,24 @@ void start_logging(LogController* controller) {
     create_control_block(controller);
 
     if (controller->android_log) {
-        // The Android collectors are not part of this build.
-        HLOG(TAG_MAIN, WLOG_INFO, "no collector for %s in this build", "main_log,radio_log,events_log");
+        fork_main_log(controller, shm_fd);
+        fork_radio_log(controller, shm_fd);
+        fork_events_log(controller, shm_fd);
+    } else {
+        mark_not_started(controller, SLOT_MAIN);
+        mark_not_started(controller, SLOT_RADIO);
+        mark_not_started(controller, SLOT_EVENTS);
     }
-    mark_not_started(controller, SLOT_MAIN);
-    mark_not_started(controller, SLOT_RADIO);
-    mark_not_started(controller, SLOT_EVENTS);
     if (controller->kernel_log) {
         fork_kernel_log(controller, shm_fd);
     } else {
         mark_not_started(controller, SLOT_KERNEL);
     }
     if (controller->bt_log) {
-        HLOG(TAG_MAIN, WLOG_INFO, "no collector for %s in this build", "bt_log");
+        fork_bt_log(controller, shm_fd);
+    } else {
+        mark_not_started(controller, SLOT_BT);
     }
-    mark_not_started(controller, SLOT_BT);
 
     HLOG(TAG_MAIN, WLOG_INFO, "M(%d),R(%d),E(%d),K(%d),B(%d)", controller->mlog_pid,
          controller->rlog_pid, controller->elog_pid, controller->klog_pid, controller->blog_pid);

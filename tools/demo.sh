@@ -1,7 +1,8 @@
 #!/usr/bin/env bash
 # The main job: build everything, boot an emulated phone whose daemon records
-# from boot into /data, move that run and its held logs onto the card with a
-# client's "copy", and show what was written.
+# its logs (Android logger buffers, kernel log, Bluetooth stack log) from boot
+# into /data, move that run and its held logs onto the card with a client's
+# "copy", and show what was written.
 set -eu
 cd "$(dirname "$0")/.."
 tools/install-deps.sh
@@ -19,20 +20,24 @@ echo "com.quorvex.log.tavlo.enabled=true" > "$phone/system/etc/qrvlog-config.pro
 
 echo "== Booting the emulated phone in $phone (recording from boot)"
 $emu boot "$phone"
+echo "== Writing logs on the phone while it boots"
+$emu exec "$phone" log -t demo "hello from the boot"
+$emu exec "$phone" log -b radio -t demo_radio "a line on the radio buffer"
+$emu exec "$phone" log -b events -t 1000003 i:3 s:demo
 for i in 1 2 3; do
     echo "<6>[demo] boot-time kernel line $i" > "$phone/.emu/kmsg"
 done
+printf 'bluetooth stack log line from the boot\n' > "$phone/.emu/btlog"
 sleep 2
 $emu exec "$phone" tavlologctl status
 echo
 echo "== Held in /data while the card is not used yet: /data/log_temp/"
 ls -l "$phone/data/log_temp"
-echo "-- kernel_log"
-cat "$phone/data/log_temp/kernel_log"
 
 echo
 echo "== A client asks for the copy to the card"
 $emu exec "$phone" tavlologctl copy
+$emu exec "$phone" log -t demo "a line after the copy"
 echo "<6>[demo] kernel line after the copy" > "$phone/.emu/kmsg"
 # The reply comes first; the held logs and the device's state follow.
 for _ in $(seq 100); do
@@ -44,10 +49,14 @@ run=$(ls -d "$phone"/sdcard/qrvlog/tavlolog/APLog_* | tail -n 1)
 echo
 echo "== The run folder on the card: $run"
 ls -l "$run"
-echo "-- kernel_log.boot (what was held, after its note line)"
-cat "$run/kernel_log.boot"
-echo "-- kernel_log (the run goes on here)"
-cat "$run/kernel_log"
+for name in main_log radio_log events_log kernel_log bt_log; do
+    echo
+    echo "-- $name.boot (what was held, after its note line)"
+    cat "$run/$name.boot"
+    echo "-- $name (the run goes on here)"
+    cat "$run/$name"
+done
+echo
 echo "-- properties (section headers)"
 grep '^<< ' "$run/properties"
 echo
@@ -60,3 +69,6 @@ $emu exec "$phone" tavlologctl stop
 echo
 echo "== Central history: $phone/data/misc/tqlog/tqlog_history"
 cat "$phone/data/misc/tqlog/tqlog_history"
+echo
+echo "== Configuration: $phone/data/misc/tqlog/tqlog_config"
+cat "$phone/data/misc/tqlog/tqlog_config"

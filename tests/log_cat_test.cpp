@@ -1,0 +1,187 @@
+// The Android collector: its merge fed from memory, and its endings with
+// datagram socket pairs standing in for the logger devices (one entry a read).
+#include "collectors/log_cat.h"
+
+#include <sys/socket.h>
+
+#include <sstream>
+
+#include "test_util.h"
+
+namespace {
+
+const char kOut[] = "/tmp/logcat_out";
+
+std::string entry(int32_t ms, const std::string& message, int priority = 4) {
+    char raw[LOGGER_READ_MAX];
+    size_t n = make_legacy_text_entry(raw, 100, 101, ms / 1000, (ms % 1000) * 1000000u, priority, "t",
+                                      message.c_str());
+    return std::string(raw, n);
+}
+
+// One token per line sent: "^main" for a beginning line, else the message.
+std::string tokens(const std::string& text) {
+    std::string out;
+    std::istringstream lines(text);
+    for (std::string line; std::getline(lines, line);) {
+        size_t begin = line.find("--------- beginning of ");
+        size_t colon = line.find(": ");
+        if (begin == 0) out += "^" + line.substr(line.rfind('/') + 1) + " ";
+        else out += (colon == std::string::npos ? "?" + line : line.substr(colon + 2)) + " ";
+    }
+    return out;
+}
+
+// A collector's engine writing into a file, devices "M" (main) and "S" (system).
+struct Engine {
+    explicit Engine(const char* devices) : cat("main_log") {
+        cat.transist_fd = open(kOut, O_RDWR | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
+        EXPECT_EQ(cat.set_output_format(), 1);
+        for (const char* d = devices; *d; d++)
+            cat.add_device(*d == 'M' ? "/dev/log/main" : "/dev/log/system", false, LOG_ID_MAIN, -1);
+    }
+    ~Engine() { close(cat.transist_fd); }
+    LogDevice* device(int index) {
+        LogDevice* d = cat.devices;
+        while (index-- > 0) d = d->next;
+        return d;
+    }
+    std::string sent() { return read_file(kOut); }
+    LogCat cat;
+};
+
+// Steps: "M 10500 m1" queues entry m1 at 10.5 s on main ("S" system); "data"
+// ends a pass that read data, "pause" a quiet batching time. Each ending adds
+// the tokens sent since the previous one and "/".
+TEST(LogCatMerge, SendsInTimeOrderAndHoldsALoneEntryUntilItIsSafe) {
+    const struct {
+        const char* name;
+        const char* devices;
+        std::vector<std::string> steps;
+        const char* expect;
+    } cases[] = {
+        {"system older", "MS", {"M 10500 m", "S 10200 s", "data", "pause"}, "/ ^system s ^main m /"},
+        {"equal times", "MS", {"M 7000 m1", "S 7000 s1", "S 7000 s2", "M 7000 m2", "pause"},
+         "^main m1 m2 ^system s1 s2 /"},
+        {"released by its own device", "MS",
+         {"M 1000 m1", "S 2000 s1", "S 3000 s2", "data", "M 4000 m2", "data", "pause"},
+         "/ ^main m1 ^system s1 / s2 m2 /"},
+        {"late arrival on one device", "MS", {"M 3000 m3", "M 1000 m1", "M 2000 m2", "data", "pause"},
+         "^main m1 m2 / m3 /"},
+        {"one device, no beginning line", "M", {"M 2000 m2", "M 1000 m1", "pause"}, "m1 m2 /"},
+    };
+    for (const auto& c : cases) {
+        Engine engine(c.devices);
+        std::string got;
+        size_t seen = 0;
+        for (const std::string& step : c.steps) {
+            if (step == "data" || step == "pause") {
+                step == "data" ? engine.cat.print_ready() : engine.cat.print_all();
+                engine.cat.flush_output();
+                std::string sent = engine.sent();
+                got += tokens(sent.substr(seen)) + "/ ";
+                seen = sent.size();
+                continue;
+            }
+            std::istringstream in(step);
+            std::string device, message;
+            int ms;
+            in >> device >> ms >> message;
+            std::string raw = entry(ms, message);
+            ASSERT_EQ(engine.cat.take_entry(engine.device(device == "S"), raw.data(), raw.size()), 1);
+        }
+        EXPECT_EQ(got, std::string(c.expect) + " ") << c.name;
+        EXPECT_EQ(engine.cat.queued_count, 0) << c.name;
+    }
+}
+
+// A lone main entry while system streams on: at 10,000 held entries a marker
+// releases it, the backlog drains in order, and the marker line follows later.
+TEST(LogCatMerge, OverloadReleasesTheHeldEntryWithAMarker) {
+    Engine engine("MS");
+    std::string raw = entry(1000, "first");
+    engine.cat.take_entry(engine.device(0), raw.data(), raw.size());
+    std::string expect = "^main first ^system ";
+    for (int i = 0; i < 10000; i++) {
+        raw = entry(2000 + i, "s" + std::to_string(i));
+        engine.cat.take_entry(engine.device(1), raw.data(), raw.size());
+        engine.cat.print_ready();
+        engine.cat.flush_output();
+        if (i < 9999) expect += "s" + std::to_string(i) + " ";
+        if (i == 9997) {
+            EXPECT_EQ(engine.sent(), "") << "held before the overload";
+        }
+    }
+    EXPECT_EQ(tokens(engine.sent()), expect);
+    engine.cat.print_all();
+    EXPECT_NE(lines_of(kOut).back().find("    0     0 W ORU     : trigger log"), std::string::npos)
+        << lines_of(kOut).back();
+}
+
+// The loop on two datagram socket pairs: whatever made it end, everything it
+// had read is sent first.
+TEST(LogCatEnds, SendsWhatItReadBeforeItEnds) {
+    const struct {
+        const char* name;
+        bool close_system, stop_word, signal;
+        int status, reason;
+    } cases[] = {
+        {"end of stream", true, false, false, 1, REASON_READ},
+        {"stop word", false, true, false, 0, REASON_NONE},
+        {"stop signal", false, false, true, 0, REASON_SIGNAL},
+    };
+    for (const auto& c : cases) {
+        RunBlock run;
+        ASSERT_TRUE(run.ok());
+        run.reset();
+        control_stop(run.block) = c.stop_word;
+        int main_pair[2], system_pair[2];
+        ASSERT_EQ(socketpair(AF_UNIX, SOCK_SEQPACKET, 0, main_pair), 0);
+        ASSERT_EQ(socketpair(AF_UNIX, SOCK_SEQPACKET, 0, system_pair), 0);
+        // The main entry is alone and older: the loop holds it back.
+        for (auto [fd, raw] : {std::pair(main_pair[1], entry(1000, "m1")), std::pair(system_pair[1], entry(2000, "s1"))})
+            ASSERT_EQ(write(fd, raw.data(), raw.size()), static_cast<ssize_t>(raw.size()));
+        if (c.close_system) close(system_pair[1]);
+        pid_t pid = fork();
+        if (pid == 0) {
+            Engine engine("");
+            engine.cat.shm_fd = run.fd;
+            install_stop_signal(&engine.cat);
+            if (!attach_control_block(&engine.cat)) _exit(99);
+            engine.cat.add_device("/dev/log/main", false, LOG_ID_MAIN, main_pair[0]);
+            engine.cat.add_device("/dev/log/system", false, LOG_ID_SYSTEM, system_pair[0]);
+            if (c.signal) {  // pending until the loop waits
+                sigset_t usr1;
+                sigemptyset(&usr1);
+                sigaddset(&usr1, SIGUSR1);
+                sigprocmask(SIG_BLOCK, &usr1, nullptr);
+                raise(SIGUSR1);
+            }
+            engine.cat.read_log_lines();
+        }
+        EXPECT_TRUE(exits_with(pid, c.status)) << c.name;
+        EXPECT_EQ(run.block->slots[SLOT_MAIN].exited, 1) << c.name;
+        EXPECT_EQ(run.block->slots[SLOT_MAIN].reason, c.reason) << c.name;
+        EXPECT_EQ(tokens(read_file(kOut)), "^main m1 ^system s1 ") << c.name;
+        for (int fd : {main_pair[0], main_pair[1], system_pair[0], system_pair[1]}) close(fd);
+    }
+    EXPECT_TRUE(history_has("read: Unexpected EOF!"));
+}
+
+TEST(LogCatEnds, ADeviceThatCannotBeOpenedEndsItWithReasonOpen) {
+    RunBlock run;
+    ASSERT_TRUE(run.ok());
+    run.reset();
+    LogCat::device_root = "/tmp/no_logger/";
+    pid_t pid = fork();
+    if (pid == 0) {
+        LogCat collector("radio_log");
+        collector.run("radio_log", "radio", run.fd);
+    }
+    EXPECT_TRUE(exits_with(pid, 1));
+    EXPECT_EQ(run.block->slots[SLOT_RADIO].exited, 1);
+    EXPECT_EQ(run.block->slots[SLOT_RADIO].reason, REASON_OPEN);
+    EXPECT_TRUE(history_has("Unable to open log device '/tmp/no_logger/radio': No such file or directory"));
+}
+
+}  // namespace
