@@ -1,5 +1,6 @@
 #include "common/io_util.h"
 
+#include <stdlib.h>
 #include <string.h>
 #include <unistd.h>
 
@@ -28,4 +29,37 @@ int copy_str(char* dst, size_t n, const char* src) {
     }
     memcpy(dst, src, len + 1);
     return 1;
+}
+
+char* read_all(int fd, size_t cap, size_t* len, bool* cut) {
+    size_t size = 4096, used = 0;
+    char* buf = static_cast<char*>(malloc(size + 1));
+    *cut = false;
+    while (buf != nullptr) {
+        if (used == size) {
+            if (size >= cap) {
+                char probe;
+                *cut = RETRY_EINTR(read(fd, &probe, 1)) > 0;
+                break;
+            }
+            size = size * 2 > cap ? cap : size * 2;
+            char* bigger = static_cast<char*>(realloc(buf, size + 1));
+            if (bigger == nullptr) {
+                *cut = true;
+                break;
+            }
+            buf = bigger;
+        }
+        ssize_t n = RETRY_EINTR(read(fd, buf + used, size - used));
+        if (n < 0) {
+            free(buf);
+            return nullptr;
+        }
+        if (n == 0) break;
+        used += static_cast<size_t>(n);
+    }
+    if (buf == nullptr) return nullptr;
+    buf[used] = '\0';
+    *len = used;
+    return buf;
 }

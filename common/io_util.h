@@ -20,3 +20,7 @@ ssize_t write_fully(int fd, const void* buf, size_t len);
 
 // Copies src into dst of size n, always NUL-terminated; returns 1 when it fit.
 int copy_str(char* dst, size_t n, const char* src);
+
+// Reads fd to its end into a new buffer (NUL-terminated, to be freed), at most
+// cap bytes: *cut is set when more followed. nullptr when a read failed.
+char* read_all(int fd, size_t cap, size_t* len, bool* cut);

@@ -3,6 +3,11 @@
 
 class LogController;
 
-// Records the boot mode, creates or loads the configuration, loads the run
-// options and starts the control socket. Returns once the control thread runs.
+// Records the boot mode, takes the path of the mode (normal 0, kelm 1, any
+// other value an other boot), which may start a run, and starts the control
+// socket. Returns once the control thread runs.
 void boot_start(LogController* controller, int boot_mode);
+
+// Points the run at /data/log_temp/ and prepares that folder; sets
+// data_storage_low. 0 when the folder cannot be made.
+int start_in_temp_folder(LogController* controller);

@@ -11,14 +11,15 @@
 #include "common/wlog.h"
 #include "config/config_store.h"
 #include "config/log_path.h"
+#include "core/boot_copy.h"
 #include "core/client_table.h"
 #include "core/control_socket.h"
 #include "core/log_controller.h"
 #include "core/logging_run.h"
 #include "platform/properties.h"
+#include "storage/debug_dump.h"
 #include "storage/history_log.h"
 
-#define HBR_FOLDER "/data/log_hbr/"
 // Size in MB of the run that carries logging through a fast power-off.
 static constexpr int HBR_LOG_MB = 60;
 
@@ -78,12 +79,17 @@ static void launch_run(LogController* controller) {
     start_logging(controller);
 }
 
+static void dump_into_run_folder(LogController* controller) {
+    run_debug_dump(controller->logpath, controller->run_folder);
+}
+
 static int start_by_command(LogController* controller, int fd, const char* word) {
     if (!prepare_run(controller)) {
         reply_word(controller, fd, word, REPLY_FAILED);
         return 0;
     }
     launch_run(controller);
+    dump_into_run_folder(controller);
     return 1;
 }
 
@@ -96,6 +102,7 @@ static int cmd_deep_start(LogController* controller, int fd) {
     HLOG(TAG_MAIN, WLOG_INFO, "'deep start' tavlolog");
     if (!start_by_command(controller, fd, CMD_DEEP_START)) return 0;
     reply_word(controller, fd, CMD_DEEP_START, REPLY_DONE);
+    copy_saved_logs(controller);
     char autostart_on[] = "autostart=1";
     apply_config_message(controller, autostart_on);
     controller->log_path_state = 1;
@@ -110,6 +117,7 @@ static int cmd_start(LogController* controller, int fd) {
     }
     HLOG(TAG_MAIN, WLOG_INFO, "start tavlolog");
     if (!start_by_command(controller, fd, CMD_START)) return 0;
+    copy_saved_logs(controller);
     reply_word(controller, fd, CMD_START, REPLY_DONE);
     return 1;
 }
@@ -140,6 +148,8 @@ static int move_run_to_log_path(LogController* controller, int fd) {
     switch_run_folder(controller, controller->run_folder);
     controller->log_path_state = 1;
     reply_word(controller, fd, CMD_COPY, REPLY_DONE);
+    copy_saved_logs(controller);
+    dump_into_run_folder(controller);
     return 1;
 }
 
@@ -161,6 +171,8 @@ static int cmd_copy(LogController* controller, int fd) {
     }
     reply_word(controller, fd, CMD_COPY, REPLY_DONE);
     launch_run(controller);
+    copy_saved_logs(controller);
+    dump_into_run_folder(controller);
     return 1;
 }
 

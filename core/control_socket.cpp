@@ -20,6 +20,7 @@
 #include "common/control_protocol.h"
 #include "common/io_util.h"
 #include "common/wlog.h"
+#include "core/boot_copy.h"
 #include "core/child_supervision.h"
 #include "core/client_table.h"
 #include "core/log_controller.h"
@@ -28,8 +29,7 @@
 #include "storage/history_log.h"
 #include "storage/storage_check.h"
 
-// No boot log arrives on the card when no client shows up within this time.
-static constexpr long long BOOT_COPY_TIMEOUT_S = 300;
+time_t boot_copy_timeout_s = BOOT_COPY_TIMEOUT_S;
 // How often "tavlologd" is tried again while another process holds it.
 static constexpr long long CONTROL_RETRY_MS = 3000;
 
@@ -197,7 +197,7 @@ static void watch(fd_set* set, int fd, int* max_fd) {
 void control_loop(LogController* controller) {
     // The time-out counts from the start of the loop: any event disarms it,
     // so until then all the time was spent waiting.
-    const long long boot_copy_deadline = now_ms() + BOOT_COPY_TIMEOUT_S * 1000;
+    const long long boot_copy_deadline = now_ms() + static_cast<long long>(boot_copy_timeout_s) * 1000;
     long long next_bind_try = now_ms() + CONTROL_RETRY_MS;
     int bind_retries = 0;
 
@@ -239,10 +239,16 @@ void control_loop(LogController* controller) {
             if (!controller->boot_copy_timer || now_ms() < boot_copy_deadline) continue;
             HLOG(TAG_MAIN, WLOG_ERROR, "select() timeout");
             controller->boot_copy_timer = 0;
+            if (boot_fail_copy(controller) < 0) {
+                HLOG(TAG_MAIN, WLOG_ERROR, "copy fail!");
+            } else {
+                HLOG(TAG_MAIN, WLOG_ERROR, "boot copy complete!");
+            }
             continue;
         }
         WLOG(TAG_MAIN, WLOG_DEBUG, "select() over,some fd can be read");
         // Any activity means a client or a run is alive: the boot copy time-out is off for good.
+        bool boot_copy_armed = controller->boot_copy_timer != 0;
         controller->boot_copy_timer = 0;
 
         if (controller->listen_fd >= 0 && FD_ISSET(controller->listen_fd, &readable)) {
@@ -260,7 +266,15 @@ void control_loop(LogController* controller) {
         if (efd_chld > 0 && FD_ISSET(efd_chld, &readable)) {
             unsigned long long deaths = read_counter(efd_chld);
             HLOG(TAG_MAIN, WLOG_INFO, "recv efd_chld %llu", deaths);
+            pid_t before[] = {controller->mlog_pid, controller->rlog_pid, controller->elog_pid,
+                              controller->klog_pid, controller->blog_pid};
             check_children(controller);
+            pid_t after[] = {controller->mlog_pid, controller->rlog_pid, controller->elog_pid,
+                             controller->klog_pid, controller->blog_pid};
+            // The daemon's own shell commands ("oru -m 3" as the boot run starts)
+            // end too: only a collector's end tells that someone is there.
+            if (boot_copy_armed && ready == 1 && memcmp(before, after, sizeof(before)) == 0)
+                controller->boot_copy_timer = 1;
         }
         if (efd_thread > 0 && FD_ISSET(efd_thread, &readable)) {
             // 1001 storage low, 1002 log folder lost (or their sum): either way the run ends.

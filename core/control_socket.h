@@ -1,9 +1,17 @@
 // The control socket "tavlologd", its thread and the text command protocol.
 #pragma once
 
+#include <time.h>
+
 class LogController;
 
 #define CONTROL_SOCKET_NAME "tavlologd"
+
+// After a normal boot into /data/log_temp/, the boot logs go to the card when
+// no client has shown up within this time.
+constexpr time_t BOOT_COPY_TIMEOUT_S = 300;
+// The wait in use: BOOT_COPY_TIMEOUT_S; only a unit test shortens it.
+extern time_t boot_copy_timeout_s;
 
 void start_control_socket(LogController* controller);
 void control_loop(LogController* controller);

@@ -27,6 +27,7 @@
 #include "core/child_supervision.h"
 #include "core/log_controller.h"
 #include "platform/properties.h"
+#include "storage/folder_records.h"
 #include "storage/history_log.h"
 #include "storage/safe_file.h"
 #include "transist/transist.h"
@@ -60,7 +61,7 @@ void compose_run_folder(LogController* controller) {
     HLOG(TAG_MAIN, WLOG_INFO, "full path is:%s", controller->run_folder);
 }
 
-int create_run_folder(LogController*, const char* base, const char* path) {
+int create_run_folder(LogController* controller, const char* base, const char* path) {
     char folder[PATH_LEN];
     size_t len = strnlen(path, PATH_LEN);
     bool needs_slash = len == 0 || path[len - 1] != '/';
@@ -88,6 +89,10 @@ int create_run_folder(LogController*, const char* base, const char* path) {
         return -1;
     }
     HLOG(TAG_MAIN, WLOG_INFO, "mkdir %s success", folder);
+    if (strcmp(base, "/data") != 0) {
+        update_folder_records(base, folder, controller->sd_log_path, controller->totallogsize,
+                              controller->logsize);
+    }
     return 1;
 }
 

@@ -2,10 +2,11 @@
 // root). Like a phone's init it gives the image's folders the owners and modes
 // the daemon expects, fills the property area from /system/build.prop and the
 // stored persist. properties, and keeps the daemon running: it starts
-// /system/bin/tavlo_log_d as root, restarts it a second after it ends, and
-// reaps every orphan. Before the daemon it starts the phone's logger devices
-// at /dev/log and the Bluetooth stack's log service (unless the boot left them
-// out). SIGTERM powers the phone off.
+// /system/bin/tavlo_log_d as root, restarts it when it ends (no sooner than
+// 5 s after its previous start, as a phone's init), and reaps every orphan.
+// Before the daemon it starts the phone's logger devices at /dev/log and the
+// Bluetooth stack's log service (unless the boot left them out). SIGTERM
+// powers the phone off.
 #include <dirent.h>
 #include <errno.h>
 #include <fcntl.h>
@@ -30,7 +31,11 @@ static const char kDaemonPath[] = "/system/bin/tavlo_log_d";
 static const char kInitLog[] = "/dev/emu/init.log";
 static const char kDaemonPidFile[] = "/dev/emu/daemon.pid";
 static const char kDataSeed[] = "/dev/.data_seed";  // image's data/ when /data is a tmpfs
-static const int kRestartDelayMs = 1000;
+// As a phone's init: a service is restarted no sooner than this after its
+// previous start, so a daemon that ends at start-up does not spin.
+static const int kRestartPeriodMs = 5000;
+static const char kExtSdcardSteps[] = "/dev/emu/ext_sdcard";
+static const char kExtSdcardTool[] = "/system/bin/ext_sdcard_tool";
 static const int kShutdownGraceMs = 1000;
 
 // Android ids the daemon's identity and the folders use.
@@ -243,6 +248,29 @@ static int hold_kmsg() {
     return fd;
 }
 
+// The engineering storage tool of the kelm boot, run in the background with
+// the steps tavlo-emu left (e.g. "after 3 link"), when it left any.
+static void start_ext_sdcard_tool(const sigset_t* old_mask) {
+    char steps[256];
+    UniqueFd fd(RETRY_EINTR(open(kExtSdcardSteps, O_RDONLY | O_CLOEXEC)));
+    if (!fd.ok()) return;
+    ssize_t n = RETRY_EINTR(read(fd.get(), steps, sizeof(steps) - 1));
+    if (n <= 0) return;
+    steps[n] = '\0';
+    const char* argv[32] = {kExtSdcardTool};
+    int argc = 1;
+    for (char* word = strtok(steps, " \n"); word != nullptr && argc < 31; word = strtok(nullptr, " \n"))
+        argv[argc++] = word;
+    argv[argc] = nullptr;
+    pid_t pid = fork();
+    if (pid == 0) {
+        sigprocmask(SIG_SETMASK, old_mask, nullptr);
+        execv(kExtSdcardTool, const_cast<char* const*>(argv));
+        _exit(127);
+    }
+    if (pid < 0) init_log("cannot start %s: %s", kExtSdcardTool, strerror(errno));
+}
+
 // The Bluetooth log service's feed is a FIFO the host writes into. Held open
 // for writing, it never shows its reader an end, and the host's writes wait in
 // it while the service is down.
@@ -408,8 +436,10 @@ int main() {
     sigaddset(&mask, SIGHUP);
     sigprocmask(SIG_BLOCK, &mask, &old_mask);
 
+    start_ext_sdcard_tool(&old_mask);
+    long long started_at = now_ms();
     pid_t daemon_pid = start_daemon(&old_mask);
-    long long restart_at = daemon_pid < 0 ? now_ms() + kRestartDelayMs : -1;
+    long long restart_at = daemon_pid < 0 ? started_at + kRestartPeriodMs : -1;
 
     for (;;) {
         struct timespec timeout = {1, 0};
@@ -432,11 +462,12 @@ int main() {
             kill(-daemon_pid, SIGKILL);
             unlink(kDaemonPidFile);
             daemon_pid = -1;
-            restart_at = now_ms() + kRestartDelayMs;
+            restart_at = started_at + kRestartPeriodMs;
         }
         if (restart_at >= 0 && now_ms() >= restart_at) {
+            started_at = now_ms();
             daemon_pid = start_daemon(&old_mask);
-            restart_at = daemon_pid < 0 ? now_ms() + kRestartDelayMs : -1;
+            restart_at = daemon_pid < 0 ? started_at + kRestartPeriodMs : -1;
         }
     }
 }

@@ -249,7 +249,6 @@ bool EmuPhone::boot(const BootOptions& options) {
 
     std::vector<std::string> args = {"boot", dir_, "--boot-mode", options.boot_mode};
     if (options.real_kmsg) args.push_back("--real-kmsg");
-    if (options.ready_at_run) args.push_back("--ready-at-run");
     if (options.sdcard_mb > 0) {
         args.push_back("--sdcard-size");
         args.push_back(std::to_string(options.sdcard_mb));
@@ -263,6 +262,10 @@ bool EmuPhone::boot(const BootOptions& options) {
     if (options.logger_kb > 0) {
         args.push_back("--logger-size");
         args.push_back(std::to_string(options.logger_kb));
+    }
+    if (!options.ext_sdcard.empty()) {
+        args.push_back("--ext-sdcard");
+        args.push_back(options.ext_sdcard);
     }
     booted_ = run_emu(args) == 0;
     return booted_;
@@ -366,7 +369,8 @@ std::string EmuPhone::host_path(const std::string& device_path) const {
         const char* device;
         const char* image;
     } kMap[] = {{"/data", "/data"},         {"/system", "/system"}, {"/mnt/sdcard2", "/sdcard2"},
-                {"/mnt/sdcard", "/sdcard"}, {"/dev/emu", "/.emu"}};
+                {"/mnt/sdcard", "/sdcard"}, {"/dev/emu", "/.emu"},
+                {"/proc/last_kmsg", "/.emu/last_kmsg"}, {"/proc/last_kmsg2", "/.emu/last_kmsg2"}};
     for (const auto& m : kMap) {
         if (under(device_path, m.device))
             return dir_ + m.image + device_path.substr(strlen(m.device));

@@ -21,7 +21,7 @@ struct BootOptions {
     int sdcard_mb = 0;                    // > 0: /mnt/sdcard is a tmpfs of that size
     int data_mb = 0;                      // > 0: /data is a tmpfs of that size (not kept at stop)
     bool real_kmsg = false;               // the host kernel's /proc/kmsg instead of the FIFO
-    bool ready_at_run = false;            // boot() returns once a run started, before serving
+    std::string ext_sdcard;               // steps of the kelm boot's storage tool ("after 3 link")
     std::vector<std::string> build_prop;  // lines added to /system/build.prop (later ones win)
     bool system_log = true;               // false: no /dev/log/system
     bool btlog = true;                    // false: no Bluetooth log service at boot
