@@ -106,6 +106,11 @@ int main(int argc, char** argv) {
         bool written = i % 16 == 0 && write_folder_records(records, "NEW", 1) == 1;
         std::vector<std::string> got = records_of(records), expected = records_model(text);
         if (got == expected && written) {
+            // Each record comes back, but one whose rewritten line outgrew what the
+            // reader takes (an empty size written as "0"): it is dropped as any such line.
+            expected.clear();
+            for (const std::string& r : got)
+                if (r.size() + 1 <= 254) expected.push_back(r);
             expected.push_back("NEW 0");
             got = records_of(read_folder_records(1));
         }
