@@ -14,6 +14,7 @@
 #include "collectors/control_block.h"
 #include "common/wlog.h"
 #include "storage/history_log.h"
+#include "storage/record_limit.h"
 
 unsigned int BtCat::pause_us = 1000000;
 
@@ -25,6 +26,23 @@ constexpr int BT_CONNECT_ATTEMPTS = 100;
 constexpr long BT_QUIET_NS = 5 * 1000 * 1000;
 // What a stop still forwards of what the service has already sent.
 constexpr int BT_STOP_CHUNKS = 256;
+// The Bluetooth stack's user on the phone.
+constexpr uid_t AID_BLUETOOTH = 1002;
+
+static RecordLimit squatter_records = RECORD_LIMIT(TAG_BT, "btlog squatter refusals");
+
+// Any app can bind an abstract name before the stack does; its bytes must not
+// land in bt_log as the stack's. Only root or the stack's user may serve it.
+static bool served_by_stack(int fd, uid_t* server) {
+    struct ucred cred;
+    socklen_t len = sizeof(cred);
+    if (getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &cred, &len) != 0) {
+        *server = static_cast<uid_t>(-1);
+        return false;
+    }
+    *server = cred.uid;
+    return cred.uid == 0 || cred.uid == AID_BLUETOOTH;
+}
 
 static void pause_a_while() {
     struct timespec left = {static_cast<time_t>(BtCat::pause_us / 1000000),
@@ -51,12 +69,20 @@ void BtCat::run(const char*, int block_fd) {
 void BtCat::connect_service() {
     for (int attempt = 1;; attempt++) {
         int fd = socket_local_client(BT_LOG_SOCKET_NAME, ANDROID_SOCKET_NAMESPACE_ABSTRACT, SOCK_STREAM);
-        if (fd >= 0) {
+        uid_t server;
+        if (fd >= 0 && served_by_stack(fd, &server)) {
             mSockListenId = fd;
             WLOG(TAG_BT, WLOG_DEBUG, "mSockListenId ok\n");
             return;
         }
-        HLOG(TAG_BT, WLOG_ERROR, "mSockListenId<0 , errno = %d", errno);
+        if (fd >= 0) {
+            // Counted as a failed attempt: the stack may still come once the name is free.
+            close(fd);
+            HLOG_LIMITED(squatter_records, TAG_BT, WLOG_ERROR,
+                         "btlog is served by uid %d, not the Bluetooth stack", static_cast<int>(server));
+        } else {
+            HLOG(TAG_BT, WLOG_ERROR, "mSockListenId<0 , errno = %d", errno);
+        }
         if (attempt >= BT_CONNECT_ATTEMPTS) {
             HLOG(TAG_BT, WLOG_ERROR, "BT connect timeout!");
             exit_collector(this, 1, REASON_BT_TIMEOUT);

@@ -80,4 +80,25 @@ TEST_F(BtCatTest, GivesUpAfterAHundredAttempts) {
     EXPECT_EQ(count_of(history, "BT connect timeout!"), 1u);
 }
 
+// An app serving "btlog" is not the stack: its bytes never reach the transist.
+TEST_F(BtCatTest, RefusesAnAppServingTheName) {
+    pid_t squatter = fork();
+    ASSERT_GE(squatter, 0);
+    if (squatter == 0) {
+        if (setgid(10050) != 0 || setuid(10050) != 0) _exit(2);
+        int fd = server(BT_LOG_SOCKET_NAME);
+        for (int c; fd >= 0 && (c = accept(fd, nullptr, nullptr)) >= 0;) {
+            (void)!write(c, "forged", 6);
+            close(c);
+        }
+        _exit(3);
+    }
+    EXPECT_TRUE(exits_with(pid_, 1));
+    pid_ = -1;
+    kill(squatter, SIGKILL);
+    waitpid(squatter, nullptr, 0);
+    EXPECT_EQ(run_.block->slots[SLOT_BT].reason, REASON_BT_TIMEOUT);
+    EXPECT_TRUE(history_has("btlog is served by uid 10050, not the Bluetooth stack"));
+}
+
 }  // namespace
