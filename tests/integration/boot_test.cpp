@@ -50,7 +50,7 @@ SCENARIOS(Boot, {
       {"has", "$RUN/kernel_log.kelm_boot", N + H}, {"gone", "/data/log_temp/kernel_log"}, {"ctl", "stop"}}},
     {"KelmBootWithoutCardStops", {}, {"--boot-mode", "1"},
      {{"wait", "kelm wait sd timeout! stop!", "60"}, {"hist", "tavlolog stop done"},
-      {"has", "/data/log_temp/kernel_log", H}, {"ctl", "stop"}}},
+      {"has", "/data/log_temp/kernel_log", H}, {"gone", "/data/log_temp/bt_log"}, {"ctl", "stop"}}},
     // About five minutes: the boot copy waits that long for a client.
     {"NoClientForFiveMinutesCopiesTheBootLogs", {kOn}, {},
      {{"kmsg", "boot line\n"}, {"wait", "select() timeout", "330"}, {"hist", "boot copy complete!"},
