@@ -18,6 +18,10 @@ SCENARIOS(Boot, {
       {"has", "/data/misc/tqlog/inter_sd_folder", "APLog_"}}},
     {"DataPathRecordsOnData", {{kOn.first, kOn.second + "qrvlog_path=/data\n"}}, {},
      {{"hist", "mkdir /data/qrvlog/tavlolog/APLog_"}, {"hist", " M("}}},
+    // init restarts a crashed daemon within the boot: what it held stays.
+    {"RestartKeepsTheHeldLogs", {kOn}, {},
+     {{"kmsg", "before the crash\n"}, {"has", "/data/log_temp/kernel_log", "before the crash"}, {"crash"},
+      {"kmsg", "after\n"}, {"has", "/data/log_temp/kernel_log", "before the crash\n" + H + "after\n"}}},
     {"LowDataStartsNoRun", {kOn}, {"--data-size", "8"},
      {{"hist", "/data is low, dont start children process(2)"}, {"ctl", "stop"}, {"gone", "/data/log_temp"},
       {"hist", " M(", "0"}}},
