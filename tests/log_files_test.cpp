@@ -77,18 +77,13 @@ TEST_F(LogFilesTest, OpenWritesTimezoneHeaderAppendsAndIsPrivate) {
     errno = 0;
     EXPECT_LT(open_log_file("/data/no/such/folder/main_log"), 0);
     EXPECT_EQ(errno, ENOENT);
-}
-
-// Descriptor 0 means "no file" elsewhere in the transist.
-TEST_F(LogFilesTest, OpenNeverHandsOutDescriptorZero) {
+    // Descriptor 0 means "no file" elsewhere in the transist.
     int saved = dup(0);
     close(0);
-    int fd = open_log_file("/data/run/kernel_log");
-    EXPECT_GT(fd, 0);
-    EXPECT_EQ(read_file("/data/run/kernel_log"), kHeader);
-    close(fd);
+    EXPECT_GT(fd = open_log_file("/data/run/kernel_log"), 0);
     dup2(saved, 0);
     close(saved);
+    if (fd > 0) close(fd);
 }
 
 TEST(RotationDue, OnlyPastTheLimit) {
@@ -139,20 +134,23 @@ TEST_F(LogFilesTest, RotatingFiveGenerationsDropsTheOldest) {
     EXPECT_EQ(read_file("/data/gen/radio_log"), kHeader + "new");
 }
 
-TEST_F(LogFilesTest, FailedReopenAfterRotationIsRecordedAndLeavesNoFile) {
+// A file that cannot be made or written leaves its type without a file, with one record.
+TEST_F(LogFilesTest, FailuresLeaveTheTypeWithoutFile) {
     mkdir("/data/gone", 0770);
     open_entry(LOG_EVENTS, "/data/gone/");
     ASSERT_EQ(system("rm -rf /data/gone"), 0);
     EXPECT_EQ(rotate_log_files(&log_files[LOG_EVENTS]), -1);
     EXPECT_EQ(log_files[LOG_EVENTS].fd, -1);
-}
+    open_run("/data/missing/", 1, 0, 1);
+    for (const LogFile& entry : log_files) EXPECT_EQ(entry.fd, -1);
+    char name[PATH_LEN];  // a folder without room for a file name
+    EXPECT_EQ(compose_log_name(name, ("/data/" + std::string(245, 'd') + "/").c_str(), LOG_MAIN), 0);
+    EXPECT_STREQ(name, "");
 
-TEST_F(LogFilesTest, FailedDataWritesAreRecordedOncePerFile) {
     write_file("/data/run/bt_log", "");
     LogFile* entry = &log_files[LOG_BT];
     ASSERT_EQ(compose_log_name(entry->name, "/data/run/", LOG_BT), 1);
     entry->fd = open(entry->name, O_RDONLY | O_CLOEXEC);  // every write fails
-    ASSERT_GT(entry->fd, 0);
     EXPECT_EQ(write_log_data(LOG_BT, "abc", 3), 0);
     EXPECT_EQ(write_log_data(LOG_BT, "def", 3), 0);
     EXPECT_EQ(entry->size, 0);
@@ -186,15 +184,6 @@ TEST_F(LogFilesTest, PlantedLinksAreNeverWrittenThrough) {
     EXPECT_EQ(read_file("/data/target"), "autostart=0\n");
 }
 
-TEST_F(LogFilesTest, CreateFailuresLeaveTheTypeWithoutFile) {
-    open_run("/data/missing/", 1, 0, 1);
-    for (const LogFile& entry : log_files) EXPECT_EQ(entry.fd, -1);
-    std::string folder = "/data/" + std::string(245, 'd') + "/";  // no room for a file name
-    char name[PATH_LEN];
-    EXPECT_EQ(compose_log_name(name, folder.c_str(), LOG_MAIN), 0);
-    EXPECT_STREQ(name, "");
-}
-
 TEST_F(LogFilesTest, ChangeFolderReopensExactlyTheOpenFiles) {
     mkdir("/data/next", 0770);
     rotate_limit_kb = 512;  // without a run only the limit changes
@@ -215,18 +204,15 @@ TEST_F(LogFilesTest, ChangeFolderReopensExactlyTheOpenFiles) {
     EXPECT_EQ(rotate_limit_kb, 2048);
     ASSERT_EQ(write_log_data(LOG_MAIN, "after", 5), 5);
     EXPECT_EQ(read_file("/data/next/main_log"), kHeader + "after");
+
+    // A folder too long for the names keeps the current file; a missing one leaves none.
+    change_log_folder(("/data/" + std::string(250, 'n') + "/").c_str(), 1024);
+    ASSERT_EQ(write_log_data(LOG_MAIN, "kept", 4), 4);
+    EXPECT_EQ(read_file("/data/next/main_log"), kHeader + "afterkept");
+    change_log_folder("/data/absent/", 1024);
+    EXPECT_EQ(log_files[LOG_MAIN].fd, -1);
 }
 
-TEST_F(LogFilesTest, ChangeFolderFailures) {
-    // A folder too long for the names: the current file is kept.
-    open_entry(LOG_BT, "/data/run/");
-    change_log_folder(("/data/" + std::string(250, 'n') + "/").c_str(), 1024);
-    EXPECT_STREQ(log_files[LOG_BT].name, "/data/run/bt_log");
-    ASSERT_EQ(write_log_data(LOG_BT, "kept", 4), 4);
-    EXPECT_EQ(read_file("/data/run/bt_log"), kHeader + "kept");
-    // A missing folder: the type is left without a file.
-    change_log_folder("/data/absent/", 1024);
-    EXPECT_EQ(log_files[LOG_BT].fd, -1);
-}
+
 
 }  // namespace

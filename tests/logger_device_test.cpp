@@ -1,6 +1,5 @@
 // The emulated phone's logger devices (emu_logger at /dev/log) against the
 // rules of the phone's logger driver that the collectors rely on.
-#include <grp.h>
 #include <poll.h>
 #include <pthread.h>
 #include <sys/uio.h>
@@ -143,31 +142,6 @@ TEST_F(LoggerDevice, ReadersEachSeeEveryEntryAndLoseOldestWhole) {
         close(fd);
     }
     close(along);
-}
-
-TEST_F(LoggerDevice, WhoMayOpenWhat) {
-    const struct {
-        const char *options, *path;
-        int flags;
-        bool log_group;  // opened as uid 2000, with or without group log
-        int error;
-    } rows[] = {
-        {"", "/dev/log/main", O_WRONLY, false, 0},         {"", "/dev/log/main", O_RDONLY, false, EACCES},
-        {"", "/dev/log/main", O_RDONLY, true, 0},          {"", LOGGER_INJECT_PATH, O_WRONLY, true, EACCES},
-        {"--no-system", "/dev/log/system", O_RDONLY, true, ENOENT},
-    };
-    for (const auto& row : rows) {
-        ASSERT_TRUE(start_logger_devices(row.options));
-        pid_t pid = fork();
-        if (pid == 0) {
-            gid_t groups[] = {1000, 1007};
-            if (setgroups(row.log_group ? 2 : 1, groups) != 0 || setresgid(1000, 1000, 1000) != 0 ||
-                setresuid(2000, 2000, 2000) != 0)
-                _exit(99);
-            _exit(open(row.path, row.flags) >= 0 ? 0 : errno);
-        }
-        EXPECT_TRUE(exits_with(pid, row.error)) << row.path << " " << row.options;
-    }
 }
 
 }  // namespace
