@@ -4,11 +4,9 @@
 // collector on a test "btlog" service.
 #include <poll.h>
 #include <sys/socket.h>
-#include <sys/time.h>
 
 #include <cutils/sockets.h>
 
-#include <thread>
 
 #include "collectors/bt_cat.h"
 #include "collectors/collector_link.h"
@@ -161,36 +159,6 @@ TEST_F(LinkTest, StopSignalWaitsWhileCheckStopUsesTheSemaphore) {
     EXPECT_EQ(run_.block->slots[SLOT_KERNEL].exited, 0);
     sem_post(run_.sem);
     expect_end(pid, SLOT_KERNEL, 0, 1, REASON_SIGNAL);
-}
-
-void on_alarm(int) {}
-
-// Signals interrupt a blocked write part-way; every byte must still arrive, in order.
-TEST(SendToTransist, DeliversEveryByteDespiteInterruptedWrites) {
-    int pair[2];
-    ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, pair), 0);
-    int small = 4096;
-    setsockopt(pair[0], SOL_SOCKET, SO_SNDBUF, &small, sizeof(small));
-    struct sigaction sa = {};
-    sa.sa_handler = on_alarm;  // no SA_RESTART: blocked writes fail with EINTR or come back short
-    sigaction(SIGALRM, &sa, nullptr);
-    struct itimerval tick = {{0, 200}, {0, 200}}, off = {};
-    setitimer(ITIMER_REAL, &tick, nullptr);
-    sigset_t alarm_set, old;
-    sigemptyset(&alarm_set);
-    sigaddset(&alarm_set, SIGALRM);
-    pthread_sigmask(SIG_BLOCK, &alarm_set, &old);  // the reader is not interrupted
-    std::string got;
-    std::thread reader([&] { receive(pair[1], &got, SIZE_MAX); });
-    pthread_sigmask(SIG_SETMASK, &old, nullptr);
-    std::string sent;
-    for (int i = 0; i < 2 * 1024 * 1024; i++) sent.push_back(static_cast<char>('a' + i % 23));
-    EXPECT_EQ(send_to_transist(sent.data(), sent.size(), pair[0]), static_cast<int>(sent.size()));
-    setitimer(ITIMER_REAL, &off, nullptr);
-    close(pair[0]);
-    reader.join();
-    close(pair[1]);
-    EXPECT_TRUE(got == sent) << got.size() << " of " << sent.size() << " bytes";
 }
 
 // Another process serves "log_socket": the collector must not hand it a byte.

@@ -4,14 +4,17 @@
 #include <limits.h>
 #include <poll.h>
 #include <sys/ioctl.h>
+#include <sys/prctl.h>
 #include <sys/socket.h>
 
 #include <thread>
 
 #include "collectors/kmsg_cat.h"
 #include "config/config_store.h"
+#include "core/boot_mode.h"
 #include "core/child_supervision.h"
 #include "core/log_controller.h"
+#include "core/privileges.h"
 #include "test_util.h"
 #include "transist/transist.h"
 
@@ -104,6 +107,50 @@ TEST(SignalChild, NeverSignalsTheDaemonsOwnGroup) {
     // kill(0, ...) would reach this process: SIGUSR1 would end the test.
     signal_child(0, SIGUSR1);
     signal_child(-1, SIGUSR1);
+}
+
+// Only the first character counts; odd content is recorded with what was read.
+TEST(BootMode, FirstCharacterOfTheFile) {
+    const struct {
+        const char* content;
+        int mode;
+        const char* record;  // "": nothing recorded
+    } cases[] = {
+        {"0", 0, ""},
+        {"1\n", 1, ""},
+        {"7", 7, ""},
+        {"10", 1, "boot mode file /tmp/boot_mode holds 2 odd byte(s), boot mode 1"},
+        {"x", 0, "boot mode file /tmp/boot_mode holds 1 odd byte(s), boot mode 0"},
+        {"", 0, "boot mode file /tmp/boot_mode holds 0 odd byte(s), boot mode 0"},
+        {"-3", 0, "boot mode file /tmp/boot_mode holds 2 odd byte(s), boot mode 0"},
+        {"\xff\xfe binary", 0, "boot mode file /tmp/boot_mode holds 8 odd byte(s), boot mode 0"},
+    };
+    for (const auto& c : cases) {
+        unlink(kHistory);
+        write_file("/tmp/boot_mode", c.content);
+        EXPECT_EQ(read_boot_mode("/tmp/boot_mode"), c.mode) << c.content;
+        if (c.record[0] != '\0') {
+            EXPECT_TRUE(has_record(c.record)) << read_file(kHistory);
+        } else {
+            EXPECT_EQ(read_file(kHistory), "");
+        }
+    }
+}
+
+TEST(BootMode, MissingFileIsMinusOneAndRecorded) {
+    EXPECT_EQ(read_boot_mode("/tmp/no/such/boot_mode"), -1);
+    EXPECT_TRUE(history_has("Failed to open boot mode file /tmp/no/such/boot_mode"));
+}
+
+TEST(Privileges, InheritableStaysWithinTheBoundingSet) {
+    for (int word = 0; word < 2; word++) {
+        uint32_t bits = inheritable_within_bounds(word, 0xFFFFFFFF);
+        for (int bit = 0; bit < 32; bit++) {
+            bool allowed = prctl(PR_CAPBSET_READ, word * 32 + bit, 0, 0, 0) == 1;
+            EXPECT_EQ((bits >> bit) & 1u, allowed ? 1u : 0u) << "capability " << word * 32 + bit;
+        }
+    }
+    EXPECT_EQ(inheritable_within_bounds(1, 0x4), 0x4u) << "syslog is in any root bounding set";
 }
 
 class RunTest : public ::testing::Test {
@@ -220,20 +267,6 @@ TEST_F(RunTest, SwitchMovesTheRunningFilesToTheNewFolder) {
     EXPECT_EQ(log_body("/data/run_test/kernel_log").find("second"), std::string::npos);
 }
 
-// A run without collectors: the check changes nothing, a second stop only records.
-TEST_F(RunTest, RunWithoutCollectorsStopsOnce) {
-    controller_.kernel_log = 0;
-    start_logging(&controller_);
-    check_children(&controller_);
-    EXPECT_EQ(property(PROP_RUNNING), "1");
-    stop_logging(&controller_);
-    unlink(kHistory);
-    controller_.log_path_state = 1;
-    stop_logging(&controller_);
-    EXPECT_EQ(controller_.log_path_state, -1);
-    EXPECT_FALSE(history_has("tavlolog stop done"));
-}
-
 // A run held in /data while the card is gone: until the writer has ended it
 // checks /data, and a notice sent during the stop does not outlive it.
 TEST_F(RunTest, StopLeavesNoFalseOrStaleStorageNotice) {
@@ -253,24 +286,6 @@ TEST_F(RunTest, StopLeavesNoFalseOrStaleStorageNotice) {
     stop_logging(&controller_);
     EXPECT_FALSE(history_has("no space to write log"));
     EXPECT_EQ(read(efd_thread, &notice, sizeof(notice)), -1) << "a stale notice would stop the next run";
-}
-
-// A collector that ends with a reason is reported with it; the last one to end
-// stops the run and every client hears of it.
-TEST_F(RunTest, CollectorThatCannotOpenItsSourceStopsTheRun) {
-    KmsgCat::kmsg_path = "/tmp/no_such_kmsg";
-    start_logging(&controller_);
-    struct pollfd p = {efd_chld, POLLIN, 0};  // the SIGCHLD notice, as the control loop waits for it
-    uint64_t count;
-    ASSERT_TRUE(wait_for([&] { return poll(&p, 1, 0) == 1; }, 5000));
-    ASSERT_EQ(read(efd_chld, &count, sizeof(count)), 8);
-    check_children(&controller_);
-    EXPECT_TRUE(history_has("oru warning comes,type is 10"));
-    EXPECT_EQ(controller_.klog_pid, 0);
-    EXPECT_EQ(property(PROP_RUNNING), "0");
-    char buf[64] = {};
-    EXPECT_GT(recv(client_[1], buf, sizeof(buf) - 1, MSG_DONTWAIT), 0);
-    EXPECT_STREQ(buf, "tqlog_stopped");
 }
 
 }  // namespace

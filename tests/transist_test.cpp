@@ -1,4 +1,5 @@
-// The transist end to end: clients on the real "log_socket", both threads, files in /data.
+// The transist: its queues, and end to end with clients on the real
+// "log_socket", both threads and files in /data.
 #include "transist/transist.h"
 
 #include <poll.h>
@@ -114,30 +115,6 @@ TEST_F(TransistTest, EveryByteSentBeforeTheStopIsInTheFile) {
     EXPECT_TRUE(log("main_log") == kHeader + tail);
     EXPECT_EQ(log("bt_log"), kHeader);
     for (const LogFile& entry : log_files) EXPECT_TRUE(entry.fd == -1 && entry.sock == -1);
-}
-
-TEST_F(TransistTest, FiveConcurrentStreamsStayInOrderAcrossRotations) {
-    start(100);  // rotate past 100K: each type spans several generations
-    const char letters[] = "MREKB";
-    std::vector<std::string> sent;
-    std::vector<std::thread> clients;
-    for (int i = 0; i < 5; i++) sent.push_back(numbered_lines(letters[i], 300000));
-    // Odd piece sizes make chunk boundaries fall anywhere in a line.
-    for (int i = 0; i < 5; i++) clients.emplace_back(stream_log, letters[i], sent[i], 1000 + 377 * i);
-    for (std::thread& t : clients) t.join();
-    stop();
-    for (int i = 0; i < 5; i++) {
-        std::string joined;
-        for (int gen = 4; gen >= 0; gen--) {
-            std::string content = log((kNames[i] + (gen > 0 ? "." + std::to_string(gen) : "")).c_str());
-            if (content.empty() && gen > 0) continue;
-            ASSERT_EQ(content.compare(0, kHeader.size(), kHeader), 0) << kNames[i] << gen;
-            size_t body = content.size() - kHeader.size();  // a file rotates after the node that passes the limit
-            EXPECT_TRUE(gen == 0 || (body >= 101u * 1024 && body <= 101u * 1024 + 65535)) << kNames[i] << gen;
-            joined += content.substr(kHeader.size());
-        }
-        EXPECT_TRUE(joined == sent[i]) << kNames[i] << ": " << joined.size() << " of " << sent[i].size() << " bytes";
-    }
 }
 
 // A connection without a log type holds up only the connections accepted after
@@ -332,6 +309,107 @@ TEST(StorageGate, LowStorageNotifiesAndHoldsTheQueues) {
         controller.clients[3].fd = -1;
         close(pair[0]);
         close(pair[1]);
+    }
+}
+
+// Node lengths of one list, head first, with tail and byte count checked.
+std::vector<int> node_lengths(const BufferList& list) {
+    std::vector<int> out;
+    int sum = 0;
+    const LogBuffer* last = nullptr;
+    for (const LogBuffer* n = list.head; n != nullptr; last = n, n = n->next) {
+        out.push_back(n->len);
+        sum += n->len;
+    }
+    EXPECT_EQ(list.tail, last);
+    EXPECT_EQ(list.bytes, sum);
+    return out;
+}
+
+std::string list_content(const BufferList& list) {
+    std::string out;
+    for (const LogBuffer* n = list.head; n != nullptr; n = n->next) out.append(n->buf, n->len);
+    return out;
+}
+
+TEST(QueueAppend, ChunksLandWholeInTheExpectedNodes) {
+    const struct {
+        int capacity;
+        std::vector<int> chunks, nodes;
+    } cases[] = {
+        {8192, {4096, 4096}, {8192}},                        // an exact fit goes into the tail
+        {8192, {4096, 4097}, {4096, 4097}},                  // one byte more starts a node
+        {4095, {1, 4095}, {1, 4095}},                        // even after an almost empty tail
+        {65535, {4095, 4095, 1810}, {10000}},                // 10000 bytes in one write
+        {65535, std::vector<int>(17, 4095), {65520, 4095}},  // sixteen full chunks fill a node
+        {10, {3, 3, 3, 1, 3}, {10, 3}},
+    };
+    for (const auto& c : cases) {
+        TransistQueue q = {};
+        std::string sent;
+        for (int n : c.chunks) {
+            std::string chunk(static_cast<size_t>(n), static_cast<char>('a' + sent.size() % 26));
+            ASSERT_EQ(queue_append(&q, LOG_KERNEL, chunk.data(), n, c.capacity), 1);
+            sent += chunk;
+        }
+        EXPECT_EQ(node_lengths(q.lists[LOG_KERNEL]), c.nodes);
+        EXPECT_EQ(list_content(q.lists[LOG_KERNEL]), sent);
+        EXPECT_EQ(q.total, static_cast<int>(sent.size()));
+        for (int t = 0; t < LOG_TYPE_COUNT; t++) EXPECT_TRUE(t == LOG_KERNEL || q.lists[t].head == nullptr) << t;
+        EXPECT_EQ(queue_clear(&q), static_cast<int>(sent.size()));
+    }
+}
+
+TEST(QueueAppend, RefusesWhatCannotBePlaced) {
+    TransistQueue q = {};
+    char data[16] = {};
+    const int rows[][3] = {{LOG_TYPE_COUNT, 4, 4095}, {-1, 4, 4095}, {LOG_MAIN, 0, 4095}, {LOG_MAIN, 16, 8}};
+    for (const auto& r : rows) EXPECT_EQ(queue_append(&q, r[0], data, r[1], r[2]), -1) << r[0] << " " << r[1];
+    EXPECT_EQ(q.total, 0);
+    EXPECT_EQ(q.lists[LOG_MAIN].head, nullptr);
+}
+
+TEST(NodePool, ReleasedNodesAreReusedUpToTheCapAndTrimmed) {
+    node_pool_trim(0);
+    TransistQueue q = {};
+    ASSERT_EQ(queue_append(&q, LOG_MAIN, "abc", 3, 4095), 1);
+    const LogBuffer* first = q.lists[LOG_MAIN].head;
+    release_head(&q.lists[LOG_MAIN]);
+    q.total = 0;
+    EXPECT_EQ(node_pool_bytes(), 4095);
+    ASSERT_EQ(queue_append(&q, LOG_KERNEL, "xy", 2, 4095), 1);
+    EXPECT_EQ(q.lists[LOG_KERNEL].head, first);  // the same block, emptied
+    EXPECT_EQ(list_content(q.lists[LOG_KERNEL]), "xy");
+    EXPECT_EQ(node_pool_bytes(), 0);
+    queue_clear(&q);
+    ASSERT_EQ(queue_append(&q, LOG_MAIN, "abc", 3, 8192), 1);
+    EXPECT_EQ(q.lists[LOG_MAIN].head->cap, 8192) << "a pooled node of another size was handed out";
+    queue_clear(&q);
+
+    // However many nodes a burst released, the pool keeps at most its cap.
+    node_pool_trim(0);
+    std::string chunk(65535, 'n');
+    for (int i = 0; i < 200; i++) ASSERT_EQ(queue_append(&q, LOG_BT, chunk.data(), 65535, 65535), 1);
+    queue_clear(&q);
+    EXPECT_LE(node_pool_bytes(), NODE_POOL_MAX_BYTES);
+    EXPECT_GT(node_pool_bytes(), NODE_POOL_MAX_BYTES - 65535);
+    node_pool_trim(3 * 65535);
+    EXPECT_EQ(node_pool_bytes(), 3 * 65535);
+    node_pool_trim(0);
+}
+
+TEST(Tuning, UnusableValuesFallBackOrAreCapped) {
+    const struct {
+        const char* value;
+        int capacity, interval;
+    } cases[] = {
+        {"65535", 65535, 2147}, {"4095", 4095, 2147},     {"4094", 65535, 2147},  {"5", 65535, 5},
+        {"0", 65535, 1},        {"-3", 65535, 1},         {"", 65535, 1},         {"12kb", 65535, 1},
+        {"99999999999999999999", 65535, 1}, {"2000000", 1048576, 2147}, {" 8192 ", 8192, 2147},
+    };
+    for (const auto& c : cases) {
+        EXPECT_EQ(choose_capacity(c.value), c.capacity) << c.value;
+        EXPECT_EQ(choose_interval(c.value), c.interval) << c.value;
     }
 }
 
