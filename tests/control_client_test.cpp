@@ -179,11 +179,4 @@ TEST(Tavlologctl, ExitCodes) {
     }
 }
 
-TEST(Tavlologctl, ListenPrintsBroadcastsUntilClosed) {
-    ScriptedServer server({"ping,1", "storage_fulltqlog_stopped", "log_folder_lost"}, true);
-    std::string out;
-    EXPECT_EQ(0, run_shell("tavlologctl --listen --send ping", &out));
-    EXPECT_EQ("ping,1\nstorage_full\ntqlog_stopped\nlog_folder_lost\n", out);
-}
-
 }  // namespace
