@@ -139,6 +139,7 @@ TEST_F(ControlSocketTest, LiveRunIsKnownWhateverTheProperty) {
     EXPECT_EQ("start,1", exchange(conn.get(), "start"));
     EXPECT_TRUE(history_has("tqlog already running, why send start"));
     EXPECT_EQ("stop,1", exchange(conn.get(), "stop"));
+    EXPECT_TRUE(history_has("tavlolog stop done")) << "the stop was ignored";
     EXPECT_EQ(count_of(read_file(kHistory), "create read/write thread success"), 1u);
 }
 

@@ -89,7 +89,22 @@ TEST(CreateRunFolder, CreatesEveryMissingFolderWithGroupAccessOrRefuses) {
         EXPECT_EQ(mode_of(c.check), c.result == 1 ? 0770u : 0u) << c.check;
     }
     EXPECT_EQ(mode_of("/mnt/sdcard/deep/a/b/c"), 0770u);
-    // A log path that leaves no room for the run's name gives no folder.
+}
+
+// The run's folder is named after its start time; a log path that leaves no
+// room for the name gives none.
+TEST(ComposeRunFolder, NamesTheFolderAfterTheStartTime) {
+    LogController controller;
+    strcpy(controller.logpath, "/mnt/sdcard");
+    time_t t = time(nullptr);
+    compose_run_folder(&controller);
+    std::string names;
+    for (struct tm tm; t <= time(nullptr); t++) {
+        char name[64];
+        strftime(name, sizeof(name), "/mnt/sdcard/qrvlog/tavlolog/APLog_%Y_%m%d_%H%M%S/", localtime_r(&t, &tm));
+        names += std::string(name) + " ";
+    }
+    EXPECT_NE(names.find(std::string(controller.run_folder) + " "), std::string::npos) << controller.run_folder;
     strcpy(controller.logpath, ("/mnt/sdcard/" + std::string(230, 'x')).c_str());
     compose_run_folder(&controller);
     EXPECT_STREQ(controller.run_folder, "");
@@ -286,6 +301,23 @@ TEST_F(RunTest, StopLeavesNoFalseOrStaleStorageNotice) {
     stop_logging(&controller_);
     EXPECT_FALSE(history_has("no space to write log"));
     EXPECT_EQ(read(efd_thread, &notice, sizeof(notice)), -1) << "a stale notice would stop the next run";
+}
+
+// A collector that cannot open its source ends with its reason; being the
+// last one, its death stops the run and every client hears of it.
+TEST_F(RunTest, CollectorThatCannotOpenItsSourceStopsTheRun) {
+    KmsgCat::kmsg_path = "/tmp/no_such_kmsg";
+    start_logging(&controller_);
+    struct pollfd p = {efd_chld, POLLIN, 0};  // the SIGCHLD notice, as the control loop waits for it
+    uint64_t count;
+    ASSERT_TRUE(wait_for([&] { return poll(&p, 1, 0) == 1; }, 5000));
+    ASSERT_EQ(read(efd_chld, &count, sizeof(count)), 8);
+    check_children(&controller_);
+    EXPECT_TRUE(history_has("oru warning comes,type is 10"));
+    EXPECT_EQ(property(PROP_RUNNING), "0");
+    char buf[64] = {};
+    EXPECT_GT(recv(client_[1], buf, sizeof(buf) - 1, MSG_DONTWAIT), 0);
+    EXPECT_STREQ(buf, "tqlog_stopped");
 }
 
 }  // namespace
