@@ -19,13 +19,6 @@ constexpr int kTimeoutMs = 5000;
 const std::string kBaseConfig =
     "autostart=0\nlogpath=internal_sd\nlogsize=300\nAndroidLog=1\nKernelLog=1\nBTLog=0\ntotallogsize=600\n";
 
-// kBaseConfig with one line replaced.
-std::string config_with(const std::string& line) {
-    std::string out = kBaseConfig;
-    size_t at = out.find(line.substr(0, line.find('=') + 1));
-    return out.replace(at, out.find('\n', at) - at, line);
-}
-
 void write_config(const std::string& content) {
     mkdir("/data/misc", 0771);
     mkdir(CONFIG_DIR, 0700);
@@ -71,33 +64,22 @@ class ControlSocketTest : public ::testing::Test {
     LogController* controller = nullptr;
 };
 
-// What a message is, on the socket (the message fuzzer checks the rules at large).
-TEST_F(ControlSocketTest, ConfigurationMessages) {
+// A message unsafe to store is refused whole (the message fuzzer checks the rules at large).
+TEST_F(ControlSocketTest, UnsafeMessagesAreRefusedAndStoreNothing) {
     const struct {
-        std::string bytes;   // exactly what the client writes
-        std::string reply;   // the text before ",1" or ",0"
-        bool done;           // ",1": not refused as unsafe to store
-        const char* key;     // setting to look at afterwards
-        const char* value;   // its stored value afterwards
-        const char* record;  // a history record that must appear, or nullptr
+        std::string bytes, reply;  // exactly what the client writes; the text before ",0"
+        const char* record;
     } cases[] = {
-        {std::string("sublog_BTLog=1\0", 15), "sublog_BTLog=1", true, "BTLog", "1", nullptr},
-        {"start", "star", true, "autostart", "0", "star is not a valid configure"},  // no terminator
-        {std::string("AndroidLog=0\0start\0", 19), "AndroidLog=0", false, "AndroidLog", "1", "(NUL byte)"},
-        {std::string("logsize=1\nlogpath=/x\0", 21), "logsize=1\nlogpath=/x", false, "logpath", "internal_sd",
+        {std::string("AndroidLog=0\0start\0", 19), "AndroidLog=0", "(NUL byte)"},
+        {std::string("logsize=1\nlogpath=/x\0", 21), "logsize=1\nlogpath=/x",
          "logsize=1\\x0alogpath=/x is not a valid configure (line feed)"},
     };
     for (const auto& c : cases) {
-        SCOPED_TRACE(c.reply);
-        write_config(kBaseConfig);
         auto conn = connect_client();
-        EXPECT_EQ(c.reply + (c.done ? REPLY_DONE : REPLY_FAILED), exchange_raw(conn.get(), c.bytes, c.reply));
-        EXPECT_EQ(c.value, config_value(c.key));
-        EXPECT_TRUE(c.record == nullptr || history_has(c.record)) << c.record << "\n" << read_file(kHistory);
-        if (("\n" + kBaseConfig).find("\n" + std::string(c.key) + "=" + c.value + "\n") != std::string::npos) {
-            EXPECT_EQ(kBaseConfig, read_file(CONFIG_FILE)) << "the file changed";
-        }
-        EXPECT_NE("1", property(PROP_RUNNING));
+        EXPECT_EQ(c.reply + REPLY_FAILED, exchange_raw(conn.get(), c.bytes, c.reply));
+        EXPECT_EQ(kBaseConfig, read_file(CONFIG_FILE));
+        EXPECT_TRUE(history_has(c.record)) << c.record << "\n" << read_file(kHistory);
+        EXPECT_NE("1", property(PROP_RUNNING)) << "the start after the NUL byte ran";
     }
 }
 
@@ -123,7 +105,7 @@ TEST_F(ControlSocketTest, StopsWhileStopped) {
     EXPECT_EQ("stop,1", exchange(conn.get(), "stopnow"));  // anything after the word is ignored
     EXPECT_EQ("0", config_value("autostart"));
 
-    write_config(config_with("autostart=1"));  // deep_stop also turns boot logging off
+    write_config("autostart=1" + kBaseConfig.substr(11));  // deep_stop also turns boot logging off
     EXPECT_EQ("deep_stop,1", exchange(conn.get(), "deep_stop"));
     EXPECT_EQ("x,1", exchange(conn.get(), "x"));  // the setting changes after the reply; still connected
     EXPECT_EQ("0", config_value("autostart"));
