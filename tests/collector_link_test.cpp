@@ -1,114 +1,76 @@
-// Collectors end their process, so the collector side always runs in a forked child.
+// Collectors end their process, so each runs in a forked child, with the test
+// serving "log_socket" and "btlog" and a FIFO standing in for /proc/kmsg.
 #include <poll.h>
 #include <sys/socket.h>
-#include <sys/time.h>
 
 #include <cutils/sockets.h>
 
-#include <thread>
-
+#include "collectors/bt_cat.h"
 #include "collectors/collector_link.h"
+#include "collectors/kmsg_cat.h"
 #include "test_util.h"
 #include "transist/transist.h"
 
 namespace {
 
-int32_t word_at(const void* base, size_t offset) {
-    int32_t value;
-    memcpy(&value, static_cast<const char*>(base) + offset, sizeof(value));
-    return value;
+const char kFifo[] = "/tmp/kmsg_fifo";
+
+int server(const char* name) { return socket_local_server(name, ANDROID_SOCKET_NAMESPACE_ABSTRACT, SOCK_STREAM); }
+
+int accept_within(int listen_fd, int ms) {
+    struct pollfd p = {listen_fd, POLLIN, 0};
+    return poll(&p, 1, ms) == 1 ? accept(listen_fd, nullptr, nullptr) : -1;
+}
+
+// Appends to *got what fd sends until want bytes came, it ends or it is quiet for ms.
+std::string receive(int fd, std::string* got, size_t want, int ms = 5000) {
+    char buf[4096];
+    struct pollfd p = {fd, POLLIN, 0};
+    ssize_t n;
+    while (got->size() < want && poll(&p, 1, ms) > 0 && (n = read(fd, buf, sizeof(buf))) > 0)
+        got->append(buf, static_cast<size_t>(n));
+    return *got;
 }
 
 class LinkTest : public ::testing::Test {
   protected:
     void SetUp() override {
+        signal(SIGPIPE, SIG_IGN);
         ASSERT_TRUE(run_.ok());
         run_.reset();
         connect_retry_us = 10000;
+        BtCat::pause_us = 2000;
     }
-    // Runs body as a collector child with the block attached; returns its pid.
+    // Runs body in a child that ends with status 77 if body returns.
     template <typename Body>
-    pid_t run_collector(CollectorKind kind, char letter, Body body) {
+    pid_t fork_child(Body body) {
         pid_t pid = fork();
         if (pid == 0) {
+            body();
+            _exit(77);
+        }
+        return pid;
+    }
+    // Runs body as a collector child with the block attached.
+    template <typename Body>
+    pid_t run_collector(CollectorKind kind, char letter, Body body) {
+        return fork_child([&] {
             CollectorLink collector(kind, letter);
             collector.shm_fd = run_.fd;
             install_stop_signal(&collector);
             if (!attach_control_block(&collector)) _exit(99);
             body(collector);
-            _exit(77);
-        }
-        return pid;
+        });
+    }
+    // The child's exit status and what its slot shows.
+    void expect_end(pid_t pid, int slot, int status, int exited, int reason) {
+        EXPECT_TRUE(exits_with(pid, status));
+        EXPECT_EQ(run_.block->slots[slot].exited, exited);
+        EXPECT_EQ(run_.block->slots[slot].reason, reason);
     }
 
     RunBlock run_;
-    ControlBlock* const block_ = run_.block;
 };
-
-// The controller reads fixed byte offsets (exited at 264*slot, reason 4 bytes
-// later) of the mapping the collector wrote through its own.
-TEST_F(LinkTest, ExitCollectorMarksTheSlotOfItsType) {
-    const struct {
-        CollectorKind kind;
-        char letter;
-        int status, reason;
-        int slot;  // 0: no slot may be marked
-        int expect_reason;
-    } cases[] = {
-        {KIND_ANDROID, 'M', 1, REASON_OUTPUT, SLOT_MAIN, REASON_OUTPUT},
-        {KIND_ANDROID, 'R', 0, REASON_SIGNAL, SLOT_RADIO, REASON_SIGNAL},
-        {KIND_ANDROID, 'E', 1, REASON_FORMAT, SLOT_EVENTS, REASON_FORMAT},
-        {KIND_KERNEL, 'K', 0, REASON_NONE, SLOT_KERNEL, REASON_NONE},  // reason kept
-        {KIND_BT, 'B', 1, REASON_BT_TIMEOUT, SLOT_BT, REASON_BT_TIMEOUT},
-        {KIND_ANDROID, 'X', 3, REASON_READ, 0, REASON_NONE},  // unknown letter: nothing marked
-    };
-    for (const auto& c : cases) {
-        run_.reset();
-        pid_t pid = run_collector(c.kind, c.letter,
-                                  [&](CollectorLink& collector) { exit_collector(&collector, c.status, c.reason); });
-        EXPECT_TRUE(exits_with(pid, c.status)) << c.letter;
-        for (size_t offset = 0; offset < CONTROL_BLOCK_SIZE; offset += 4) {
-            if (offset >= CONTROL_SEM_OFFSET && offset < CONTROL_SEM_OFFSET + sizeof(sem_t)) continue;
-            int slot = static_cast<int>(offset / CONTROL_SLOT_SIZE);
-            size_t word = offset % CONTROL_SLOT_SIZE;
-            int32_t expected = 0;
-            if (slot >= SLOT_MAIN && word == 0) expected = slot == c.slot ? 1 : 0;
-            if (slot >= SLOT_MAIN && word == 4) expected = slot == c.slot ? c.expect_reason : REASON_NONE;
-            EXPECT_EQ(word_at(block_, offset), expected) << c.letter << " offset " << offset;
-        }
-    }
-    EXPECT_TRUE(history_has("unknow log type X"));
-}
-
-TEST_F(LinkTest, CheckStopEndsOnlyOnceStopIsSet) {
-    auto check_then_42 = [](CollectorLink& collector) {
-        check_stop(&collector);
-        _exit(42);
-    };
-    EXPECT_TRUE(exits_with(run_collector(KIND_KERNEL, 'K', check_then_42), 42));
-    EXPECT_EQ(block_->slots[SLOT_KERNEL].exited, 0);
-
-    int32_t one = 1;
-    memcpy(block_, &one, sizeof(one));  // the controller's stop word at offset 0
-    EXPECT_TRUE(exits_with(run_collector(KIND_KERNEL, 'K', check_then_42), 0));
-    EXPECT_EQ(block_->slots[SLOT_KERNEL].exited, 1);
-    EXPECT_EQ(block_->slots[SLOT_KERNEL].reason, REASON_NONE);
-    EXPECT_EQ(sem_trywait(run_.sem), 0) << "the semaphore was not given back";
-    sem_post(run_.sem);
-}
-
-TEST_F(LinkTest, StopSignalBeforeTheBlockIsMappedEndsWithStatusZero) {
-    pid_t pid = fork();
-    ASSERT_GE(pid, 0);
-    if (pid == 0) {
-        CollectorLink collector(KIND_KERNEL, 'K');
-        install_stop_signal(&collector);
-        raise(SIGUSR1);
-        _exit(77);
-    }
-    EXPECT_TRUE(exits_with(pid, 0));
-    EXPECT_EQ(block_->slots[SLOT_KERNEL].exited, 0);
-}
 
 // Signals queued for the whole process, from /proc.
 unsigned long long shared_pending(pid_t pid) {
@@ -123,9 +85,9 @@ TEST_F(LinkTest, StopSignalWaitsWhileCheckStopUsesTheSemaphore) {
     ASSERT_EQ(sem_wait(run_.sem), 0);  // the controller holds the block
     int ready[2];
     ASSERT_EQ(pipe(ready), 0);
-    pid_t pid = run_collector(KIND_KERNEL, 'K', [&](CollectorLink& collector) {
+    pid_t pid = run_collector(KIND_KERNEL, 'K', [&](CollectorLink& link) {
         if (write(ready[1], "r", 1) != 1) _exit(98);
-        for (;;) check_stop(&collector);
+        for (;;) check_stop(&link);
     });
     close(ready[1]);
     char byte;
@@ -136,111 +98,162 @@ TEST_F(LinkTest, StopSignalWaitsWhileCheckStopUsesTheSemaphore) {
     usleep(50000);
     EXPECT_NE(shared_pending(pid) & (1ULL << (SIGUSR1 - 1)), 0ULL)
         << "the stop handler ran while check_stop was using the semaphore";
-    EXPECT_EQ(block_->slots[SLOT_KERNEL].exited, 0);
+    EXPECT_EQ(run_.block->slots[SLOT_KERNEL].exited, 0);
     sem_post(run_.sem);
-
-    EXPECT_TRUE(exits_with(pid, 0, 2000)) << "collector did not end on the stop signal";
-    EXPECT_EQ(block_->slots[SLOT_KERNEL].exited, 1);
-    EXPECT_EQ(block_->slots[SLOT_KERNEL].reason, REASON_SIGNAL);
-    EXPECT_EQ(read_file("/dev/emu/wlog").find("busy for"), std::string::npos);
-}
-
-void on_alarm(int) {}
-
-// Signals interrupt a blocked write part-way; every byte must still arrive, in order.
-TEST(SendToTransist, DeliversEveryByteDespiteInterruptedWrites) {
-    int pair[2];
-    ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, pair), 0);
-    int small = 4096;
-    setsockopt(pair[0], SOL_SOCKET, SO_SNDBUF, &small, sizeof(small));
-    struct sigaction sa = {};
-    sa.sa_handler = on_alarm;
-    sa.sa_flags = 0;  // blocked writes fail with EINTR or come back short
-    sigaction(SIGALRM, &sa, nullptr);
-    struct itimerval tick = {{0, 200}, {0, 200}}, off = {};
-    setitimer(ITIMER_REAL, &tick, nullptr);
-    sigset_t alarm_set, old;
-    sigemptyset(&alarm_set);
-    sigaddset(&alarm_set, SIGALRM);
-    pthread_sigmask(SIG_BLOCK, &alarm_set, &old);  // the reader is not interrupted
-    std::string got;
-    std::thread reader([&] {
-        char buf[1000];
-        for (ssize_t n; (n = read(pair[1], buf, sizeof(buf))) != 0 && (n > 0 || errno == EINTR);)
-            if (n > 0) got.append(buf, static_cast<size_t>(n));
-    });
-    pthread_sigmask(SIG_SETMASK, &old, nullptr);
-
-    std::string sent;
-    for (int i = 0; i < 2 * 1024 * 1024; i++) sent.push_back(static_cast<char>('a' + i % 23));
-    EXPECT_EQ(send_to_transist(sent.data(), sent.size(), pair[0]), static_cast<int>(sent.size()));
-    setitimer(ITIMER_REAL, &off, nullptr);
-    close(pair[0]);
-    reader.join();
-    close(pair[1]);
-    EXPECT_EQ(got.size(), sent.size());
-    EXPECT_TRUE(got == sent);
-}
-
-// Reads from fd until it ends or want bytes came, for at most timeout_ms per read.
-std::string read_some(int fd, size_t want, int timeout_ms) {
-    std::string got;
-    char buf[4096];
-    struct pollfd p = {fd, POLLIN, 0};
-    ssize_t n;
-    while (got.size() < want && poll(&p, 1, timeout_ms) > 0 && (n = read(fd, buf, sizeof(buf))) > 0)
-        got.append(buf, static_cast<size_t>(n));
-    return got;
-}
-
-int accept_within(int listen_fd, int timeout_ms) {
-    struct pollfd p = {listen_fd, POLLIN, 0};
-    return poll(&p, 1, timeout_ms) <= 0 ? -1 : accept(listen_fd, nullptr, nullptr);
+    expect_end(pid, SLOT_KERNEL, 0, 1, REASON_SIGNAL);
 }
 
 // Another process serves "log_socket": the collector must not hand it a byte.
 TEST_F(LinkTest, RefusesALogSocketServedByAnotherProcess) {
     int report[2];
     ASSERT_EQ(pipe(report), 0);
-    pid_t squatter = fork();
-    ASSERT_GE(squatter, 0);
-    if (squatter == 0) {
-        int server = socket_local_server(LOG_SOCKET_NAME, ANDROID_SOCKET_NAMESPACE_ABSTRACT, SOCK_STREAM);
-        if (server < 0 || write(report[1], "L", 1) != 1) _exit(2);
-        size_t received = 0;
-        for (int conn; (conn = accept_within(server, 500)) >= 0; close(conn)) received += read_some(conn, 1, 200).size();
-        _exit(received == 0 ? 0 : 1);
-    }
+    pid_t squatter = fork_child([&] {
+        int listen_fd = server(LOG_SOCKET_NAME);
+        if (listen_fd < 0 || write(report[1], "L", 1) != 1) _exit(2);
+        std::string got;
+        for (int conn; (conn = accept_within(listen_fd, 500)) >= 0; close(conn)) receive(conn, &got, 1, 200);
+        _exit(got.empty() ? 0 : 1);
+    });
     close(report[1]);
     char ready;
     ASSERT_EQ(read(report[0], &ready, 1), 1);
     close(report[0]);
-
-    pid_t pid = run_collector(KIND_KERNEL, 'K', [](CollectorLink& collector) {
-        connect_transist(&collector);
-        _exit(55);  // must never get here
-    });
-    EXPECT_TRUE(exits_with(pid, 1));
-    EXPECT_EQ(block_->slots[SLOT_KERNEL].exited, 1);
-    EXPECT_EQ(block_->slots[SLOT_KERNEL].reason, REASON_NONE);
+    pid_t pid = run_collector(KIND_KERNEL, 'K', [](CollectorLink& link) { connect_transist(&link); });
+    expect_end(pid, SLOT_KERNEL, 1, 1, REASON_NONE);
     EXPECT_TRUE(exits_with(squatter, 0)) << "the squatter received data";
-    std::string history = read_file(kHistory);
-    EXPECT_EQ(count_of(history, "log_socket is served by pid " + std::to_string(squatter) + ", not the daemon"), 5u);
-    EXPECT_EQ(count_of(history, "Has been retry 5s.."), 1u);
+    EXPECT_EQ(count_of(read_file(kHistory), "log_socket is served by pid " + std::to_string(squatter)), 5u);
 }
 
-TEST_F(LinkTest, GivesUpAfterFiveAttemptsWhenNothingServes) {
-    pid_t pid = run_collector(KIND_BT, 'B', [](CollectorLink& collector) {
-        connect_transist(&collector);
-        _exit(55);
+// The kernel collector with the test serving "log_socket".
+class KmsgCatTest : public LinkTest {
+  protected:
+    void SetUp() override {
+        LinkTest::SetUp();
+        unlink(kFifo);
+        ASSERT_EQ(mkfifo(kFifo, 0600), 0);
+        // Read-write: opening never blocks, and the source has a writer until the test closes it.
+        ASSERT_GE(source_ = open(kFifo, O_RDWR), 0);
+        ASSERT_GE(server_ = server(LOG_SOCKET_NAME), 0);
+    }
+    void TearDown() override {
+        for (int fd : {conn_, source_, server_})
+            if (fd >= 0) close(fd);
+    }
+    pid_t start_collector(int block_fd, bool accept_it) {
+        KmsgCat::kmsg_path = kFifo;
+        pid_t pid = fork_child([&] {
+            close(source_);
+            close(server_);
+            KmsgCat().run("kernel_log", block_fd);
+        });
+        if (accept_it) {
+            EXPECT_GE(conn_ = accept_within(server_, 5000), 0) << "the collector did not connect";
+        }
+        return pid;
+    }
+    void feed(const std::string& text) {
+        ASSERT_EQ(write(source_, text.data(), text.size()), static_cast<ssize_t>(text.size()));
+    }
+    int source_ = -1, server_ = -1, conn_ = -1;
+    std::string got_;
+};
+
+TEST_F(KmsgCatTest, ForwardsMessagesWholeAndInOrderAfterTheLetter) {
+    pid_t pid = start_collector(run_.fd, true);
+    std::string sent;
+    for (size_t length : {1, 254, 255, 256, 600, 4096, 10000}) {
+        std::string message;
+        for (size_t j = 0; j < length; j++) message.push_back(static_cast<char>('A' + (length + j) % 26));
+        sent += message + "\n";
+        feed(message + "\n");
+    }
+    sent += std::string("\0\x01\xff binary\n", 12);
+    feed(std::string("\0\x01\xff binary\n", 12));
+    EXPECT_TRUE(receive(conn_, &got_, 1 + sent.size()) == "K" + sent);
+    kill(pid, SIGKILL);
+    waitpid(pid, nullptr, 0);
+}
+
+// Each way the kernel collector ends, with its exit status and what its slot shows.
+TEST_F(KmsgCatTest, Endings) {
+    enum How { STOP_WORD, STOP_SIGNAL, NO_BLOCK, SEND_FAILS };
+    const struct {
+        How how;
+        int status, exited, reason;
+    } cases[] = {
+        {STOP_WORD, 0, 1, REASON_NONE}, {STOP_SIGNAL, 0, 1, REASON_SIGNAL},
+        {NO_BLOCK, 1, 0, REASON_NONE},  {SEND_FAILS, 77, 0, REASON_NONE},  // run returns, nothing marked
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.how);
+        run_.reset();
+        got_.clear();
+        pid_t pid = start_collector(c.how == NO_BLOCK ? -1 : run_.fd, c.how != NO_BLOCK);
+        if (c.how == STOP_WORD) {
+            ASSERT_EQ(sem_wait(run_.sem), 0);
+            control_stop(run_.block) = 1;
+            sem_post(run_.sem);
+            feed("wake\n");  // the collector looks at the stop word after its wait
+        } else if (c.how == STOP_SIGNAL) {
+            feed("one line\n");
+            receive(conn_, &got_, 10);
+            usleep(20000);  // parked in its wait again
+            kill(pid, SIGUSR1);
+        } else if (c.how == SEND_FAILS) {
+            EXPECT_EQ(receive(conn_, &got_, 1), "K");
+            close(conn_);  // the transist went away
+            conn_ = -1;
+            feed("lost\n");
+        }
+        expect_end(pid, SLOT_KERNEL, c.status, c.exited, c.reason);
+        if (conn_ >= 0) close(conn_);
+        conn_ = -1;
+    }
+}
+
+// The Bluetooth collector, started before any "btlog" serves.
+class BtCatTest : public LinkTest {
+  protected:
+    void SetUp() override {
+        LinkTest::SetUp();
+        pid_ = fork_child([&] { BtCat().run("bt_log", run_.fd); });
+    }
+    pid_t pid_ = -1;
+};
+
+// Late service, then a chunk longer than one read, then the service ends.
+TEST_F(BtCatTest, ForwardsTheLateServiceExactlyAndEndsWhenItCloses) {
+    ASSERT_TRUE(wait_for([] { return history_has("mSockListenId<0 , errno = 111"); }, 5000));
+    int service = server(BT_LOG_SOCKET_NAME), transist = server(LOG_SOCKET_NAME);
+    int from_collector = accept_within(service, 5000), to_transist = accept_within(transist, 5000);
+    ASSERT_GE(from_collector, 0);
+    ASSERT_GE(to_transist, 0);
+    std::string chunk, got;
+    for (int i = 0; i < 600; i++) chunk.push_back(static_cast<char>(i * 7));
+    ASSERT_EQ(write(from_collector, chunk.data(), chunk.size()), 600);
+    EXPECT_TRUE(receive(to_transist, &got, 601) == "B" + chunk) << got.size() << " bytes";
+    close(from_collector);
+    expect_end(pid_, SLOT_BT, 0, 1, REASON_READ);
+    EXPECT_LT(accept_within(service, 0), 0) << "it connected again";
+    for (int fd : {service, transist, to_transist}) close(fd);
+}
+
+TEST_F(BtCatTest, GivesUpAfterAHundredAttempts) {
+    expect_end(pid_, SLOT_BT, 1, 1, REASON_BT_TIMEOUT);
+    EXPECT_EQ(count_of(read_file(kHistory), "mSockListenId<0 , errno = 111"), 100u);
+}
+
+// An app serving "btlog" is not the stack: its bytes never reach the transist.
+TEST_F(BtCatTest, RefusesAnAppServingTheName) {
+    pid_t squatter = fork_child([] {
+        if (setgid(10050) != 0 || setuid(10050) != 0) _exit(2);
+        int fd = server(BT_LOG_SOCKET_NAME);
+        for (int c; fd >= 0 && (c = accept(fd, nullptr, nullptr)) >= 0; close(c)) (void)!write(c, "forged", 6);
     });
-    EXPECT_TRUE(exits_with(pid, 1));
-    EXPECT_EQ(block_->slots[SLOT_BT].exited, 1);
-    std::string history = read_file(kHistory);
-    std::string refused = std::string("socket fd < 0(") + strerror(ECONNREFUSED) + "), errno = " +
-                          std::to_string(ECONNREFUSED) + ".";
-    EXPECT_EQ(count_of(history, refused), 6u);  // five attempts, then the give-up record
-    EXPECT_EQ(count_of(history, "Has retry 5s.."), 1u);
+    expect_end(pid_, SLOT_BT, 1, 1, REASON_BT_TIMEOUT);
+    kill(squatter, SIGKILL);
+    waitpid(squatter, nullptr, 0);
+    EXPECT_TRUE(history_has("btlog is served by uid 10050, not the Bluetooth stack"));
 }
 
 }  // namespace

@@ -19,13 +19,6 @@ constexpr int kTimeoutMs = 5000;
 const std::string kBaseConfig =
     "autostart=0\nlogpath=internal_sd\nlogsize=300\nAndroidLog=1\nKernelLog=1\nBTLog=0\ntotallogsize=600\n";
 
-// kBaseConfig with one line replaced.
-std::string config_with(const std::string& line) {
-    std::string out = kBaseConfig;
-    size_t at = out.find(line.substr(0, line.find('=') + 1));
-    return out.replace(at, out.find('\n', at) - at, line);
-}
-
 void write_config(const std::string& content) {
     mkdir("/data/misc", 0771);
     mkdir(CONFIG_DIR, 0700);
@@ -60,12 +53,6 @@ std::string exchange(ControlConnection* conn, const std::string& cmd) {
     return exchange_raw(conn, cmd + '\0', cmd);
 }
 
-// True when the daemon has closed conn (nothing but the end of the stream follows).
-bool closed_by_daemon(ControlConnection* conn) {
-    char event[CONTROL_RECV_MAX];
-    return control_next_event(conn, event, sizeof(event), kTimeoutMs) == CC_CLOSED;
-}
-
 class ControlSocketTest : public ::testing::Test {
   protected:
     void SetUp() override {
@@ -77,52 +64,22 @@ class ControlSocketTest : public ::testing::Test {
     LogController* controller = nullptr;
 };
 
-TEST_F(ControlSocketTest, ConfigurationMessages) {
+// A message unsafe to store is refused whole (the message fuzzer checks the rules at large).
+TEST_F(ControlSocketTest, UnsafeMessagesAreRefusedAndStoreNothing) {
     const struct {
-        std::string bytes;   // exactly what the client writes
-        std::string reply;   // the text before ",1" or ",0"
-        bool done;           // ",1": not refused as unsafe to store
-        const char* key;     // setting to look at afterwards
-        const char* value;   // its stored value afterwards
-        const char* record;  // a history record that must appear, or nullptr
+        std::string bytes, reply;  // exactly what the client writes; the text before ",0"
+        const char* record;
     } cases[] = {
-        {"KernelLog=0\n", "KernelLog=0", true, "KernelLog", "0", "recv 'KernelLog=0' from client"},
-        {std::string("sublog_BTLog=1\0", 15), "sublog_BTLog=1", true, "BTLog", "1", nullptr},
-        {std::string("sublogBTLog=1\0", 14), "sublogBTLog=1", true, "BTLog", "0", "sublogBTLog=1 is not a valid configure"},
-        {std::string("hello\0", 6), "hello", true, "BTLog", "0", "hello is not a valid configure"},
-        {std::string("=1\0", 3), "=1", true, "BTLog", "0", "=1 is not a valid configure"},
-        {"start", "star", true, "autostart", "0", "star is not a valid configure"},  // no terminator
-        {std::string("logsize=200   \0", 15), "logsize=200", true, "logsize", "200", nullptr},
-        {std::string("  logsize=250\0", 14), "  logsize=250", true, "logsize", "250", nullptr},  // leading spaces stay
-        {std::string("BTLog=1\t\r\0", 10), "BTLog=1\t\r", true, "BTLog", "1\t\r", nullptr},  // add no line: stored
-        {std::string("AndroidLog=0\0start\0", 19), "AndroidLog=0", false, "AndroidLog", "1",
-         "AndroidLog=0 is not a valid configure (NUL byte)"},
-        {std::string("logsize=1\nlogpath=/x\0", 21), "logsize=1\nlogpath=/x", false, "logpath", "internal_sd",
+        {std::string("AndroidLog=0\0start\0", 19), "AndroidLog=0", "(NUL byte)"},
+        {std::string("logsize=1\nlogpath=/x\0", 21), "logsize=1\nlogpath=/x",
          "logsize=1\\x0alogpath=/x is not a valid configure (line feed)"},
-        {std::string("\x01\x02\xfe=\x03\0", 6), "\x01\x02\xfe=\x03", true, "BTLog", "0",
-         "recv '\\x01\\x02\xfe=\\x03' from client"},
-        {"logpath=" + std::string(100, 'a') + '\0', "logpath=" + std::string(100, 'a'), false, "logpath",
-         "internal_sd", "is not a valid configure (too long)"},
-        {std::string("logpath=tmp\0", 12), "logpath=tmp", false, "logpath", "internal_sd",
-         "logpath=tmp is not a valid configure (not an absolute path)"},
-        {std::string("logpath=/mnt/sdcard/../../data/misc\0", 36), "logpath=/mnt/sdcard/../../data/misc", false,
-         "logpath", "internal_sd", nullptr},
-        {std::string("logpath=/mnt/sdcard2/logs\0", 26), "logpath=/mnt/sdcard2/logs", true, "logpath",
-         "/mnt/sdcard2/logs", nullptr},
-        {std::string("logsize=\0", 9), "logsize=", false, "logsize", "300", "logsize= is not a valid configure (empty value)"},
-        {std::string("colour=blue\0", 12), "colour=blue", true, "logsize", "300", "update item colour=blue to cache failed"},
     };
     for (const auto& c : cases) {
-        SCOPED_TRACE(c.reply);
-        write_config(kBaseConfig);
         auto conn = connect_client();
-        EXPECT_EQ(c.reply + (c.done ? REPLY_DONE : REPLY_FAILED), exchange_raw(conn.get(), c.bytes, c.reply));
-        EXPECT_EQ(c.value, config_value(c.key));
-        EXPECT_TRUE(c.record == nullptr || history_has(c.record)) << c.record << "\n" << read_file(kHistory);
-        if (("\n" + kBaseConfig).find("\n" + std::string(c.key) + "=" + c.value + "\n") != std::string::npos) {
-            EXPECT_EQ(kBaseConfig, read_file(CONFIG_FILE)) << "the file changed";
-        }
-        EXPECT_NE("1", property(PROP_RUNNING));
+        EXPECT_EQ(c.reply + REPLY_FAILED, exchange_raw(conn.get(), c.bytes, c.reply));
+        EXPECT_EQ(kBaseConfig, read_file(CONFIG_FILE));
+        EXPECT_TRUE(history_has(c.record)) << c.record << "\n" << read_file(kHistory);
+        EXPECT_NE("1", property(PROP_RUNNING)) << "the start after the NUL byte ran";
     }
 }
 
@@ -144,34 +101,14 @@ TEST_F(ControlSocketTest, StopsWhileStopped) {
     auto conn = connect_client();
     controller->log_path_state = 0;
     EXPECT_EQ("stop,1", exchange(conn.get(), "stop"));
-    EXPECT_TRUE(history_has("tavlolog already stopped, ignore this stop"));
     EXPECT_EQ(-1, controller->log_path_state);
     EXPECT_EQ("stop,1", exchange(conn.get(), "stopnow"));  // anything after the word is ignored
     EXPECT_EQ("0", config_value("autostart"));
 
-    EXPECT_EQ("HBR_SHUTDOWN,1", exchange(conn.get(), "HBR_SHUTDOWN"));  // without boot logging: a stop
-    EXPECT_TRUE(history_has("as boot option is 0, stop tavlolog for hbrshutdown"));
-
-    write_config(config_with("autostart=1"));  // deep_stop also turns boot logging off
+    write_config("autostart=1" + kBaseConfig.substr(11));  // deep_stop also turns boot logging off
     EXPECT_EQ("deep_stop,1", exchange(conn.get(), "deep_stop"));
     EXPECT_EQ("x,1", exchange(conn.get(), "x"));  // the setting changes after the reply; still connected
     EXPECT_EQ("0", config_value("autostart"));
-}
-
-// debug.TQ.running is the one record of the running state: with it set, the
-// start commands answer without starting anything.
-TEST_F(ControlSocketTest, CommandsWhileRunning) {
-    ASSERT_EQ(0, property_set(PROP_RUNNING, "1"));
-    controller->log_path_state = 1;
-    auto conn = connect_client();
-    EXPECT_EQ("start,1", exchange(conn.get(), "start"));
-    EXPECT_TRUE(history_has("tqlog already running, why send start"));
-    EXPECT_EQ("deep_start,1", exchange(conn.get(), "deep_start"));
-    EXPECT_TRUE(history_has("tqlog already running, why send deep_start"));
-    EXPECT_EQ("copy,1", exchange(conn.get(), "copy"));
-    EXPECT_TRUE(history_has("has copyed to sd,ignore this 'copy'"));
-    EXPECT_EQ("0", config_value("autostart"));
-    ASSERT_EQ(0, property_set(PROP_RUNNING, "0"));
 }
 
 // The daemon's own record of a live run decides too: the shell can set
@@ -184,38 +121,8 @@ TEST_F(ControlSocketTest, LiveRunIsKnownWhateverTheProperty) {
     EXPECT_EQ("start,1", exchange(conn.get(), "start"));
     EXPECT_TRUE(history_has("tqlog already running, why send start"));
     EXPECT_EQ("stop,1", exchange(conn.get(), "stop"));
-    EXPECT_TRUE(history_has("tavlolog stop done"));
+    EXPECT_TRUE(history_has("tavlolog stop done")) << "the stop was ignored";
     EXPECT_EQ(count_of(read_file(kHistory), "create read/write thread success"), 1u);
-}
-
-// A start whose folder cannot be made answers ",0" and drops the client.
-TEST_F(ControlSocketTest, StartFailsWithoutFolder) {
-    write_config(config_with("logpath=/proc/tqlog"));
-    for (const char* word : {"start", "deep_start", "copy"}) {
-        SCOPED_TRACE(word);
-        auto conn = connect_client();
-        EXPECT_EQ(std::string(word) + REPLY_FAILED, exchange(conn.get(), word));
-        EXPECT_TRUE(closed_by_daemon(conn.get()));
-        EXPECT_NE("1", property(PROP_RUNNING));
-    }
-    EXPECT_TRUE(history_has("exception when handle message, close client"));
-    EXPECT_EQ("0", config_value("autostart")) << "deep_start turned boot logging on";
-}
-
-// Each counter is read once and recorded with the value read (on its own, so
-// the records need a moment).
-TEST_F(ControlSocketTest, EventCounters) {
-    uint64_t value = 1001;
-    ASSERT_EQ(8, write(efd_thread, &value, sizeof(value)));
-    EXPECT_TRUE(wait_for([] { return history_has("recv efd_thread 1001"); }, kTimeoutMs));
-    EXPECT_TRUE(wait_for([] { return history_has("tavlolog already stopped, ignore this stop"); }, kTimeoutMs));
-    value = 1;
-    ASSERT_EQ(8, write(efd_chld, &value, sizeof(value)));
-    EXPECT_TRUE(wait_for([] { return history_has("recv efd_chld 1"); }, kTimeoutMs));
-    EXPECT_TRUE(wait_for([] { return history_has("all processes die, no need to check"); }, kTimeoutMs));
-    EXPECT_NE(read_file("/dev/emu/wlog").find("recv efd_thread 1001"), std::string::npos);
-    auto conn = connect_client();  // the loop goes on serving clients
-    EXPECT_EQ("x,1", exchange(conn.get(), "x"));
 }
 
 // "tavlologd" held by another process (after the daemon died): recorded once,
@@ -233,12 +140,11 @@ TEST(ControlSocketHeld, IsServedAsSoonAsItIsFree) {
     ASSERT_TRUE(wait_for([&] { return control_connect(&conn, 100) == CC_OK; }, 10000));
     EXPECT_EQ("x,1", exchange(&conn, "x"));
     EXPECT_EQ(count_of(read_file(kHistory), "create socket 'tavlologd' failed"), 1u);
-    EXPECT_TRUE(history_has("socket 'tavlologd' ready after"));
 }
 
 // Shell commands the daemon runs ("oru -m 3") must not inherit client
 // connections, or a client would never see its connection close.
-TEST_F(ControlSocketTest, DescriptorsAreCloseOnExecAndThreadIsNamed) {
+TEST_F(ControlSocketTest, DescriptorsAreCloseOnExec) {
     auto conn = connect_client();
     EXPECT_EQ("x,1", exchange(conn.get(), "x"));
     EXPECT_TRUE(fcntl(controller->listen_fd, F_GETFD) & FD_CLOEXEC);
@@ -247,7 +153,6 @@ TEST_F(ControlSocketTest, DescriptorsAreCloseOnExecAndThreadIsNamed) {
     pthread_mutex_unlock(&controller->client_lock);
     ASSERT_GT(client_fd, 0);
     EXPECT_TRUE(fcntl(client_fd, F_GETFD) & FD_CLOEXEC);
-    EXPECT_TRUE(has_thread("tavlo.control"));
 }
 
 }  // namespace

@@ -43,18 +43,15 @@ class LogFilesTest : public ::testing::Test {
 };
 
 TEST(LogHeader, FitsOneLineOfAtMost99Bytes) {
-    const struct {
-        std::string zone, line;
-    } cases[] = {
+    const std::string cases[][2] = {
         {std::string(83, 'z'), "-----timezone: " + std::string(83, 'z') + "\n"},  // the longest that fits
         {std::string(91, 'y'), "-----timezone: " + std::string(83, 'y') + "\n"},
         {"Europe/Paris\n-----fake", "-----timezone: Europe/Paris?-----fake\n"},  // one line, whatever the zone
     };
     for (const auto& c : cases) {
         char out[HEADER_MAX + 1];
-        int len = format_header(out, sizeof(out), c.zone.c_str());
-        EXPECT_EQ(std::string(out, static_cast<size_t>(len)), c.line);
-        EXPECT_LE(len, HEADER_MAX);
+        int len = format_header(out, sizeof(out), c[0].c_str());
+        EXPECT_EQ(std::string(out, static_cast<size_t>(std::max(len, 0))), c[1]);
     }
 }
 
@@ -74,21 +71,13 @@ TEST_F(LogFilesTest, OpenWritesTimezoneHeaderAppendsAndIsPrivate) {
     EXPECT_EQ(read_file(path), kHeader + "-----timezone: Asia/Tokyo\n");
     close(fd);
 
-    errno = 0;
-    EXPECT_LT(open_log_file("/data/no/such/folder/main_log"), 0);
-    EXPECT_EQ(errno, ENOENT);
-}
-
-// Descriptor 0 means "no file" elsewhere in the transist.
-TEST_F(LogFilesTest, OpenNeverHandsOutDescriptorZero) {
+    // Descriptor 0 means "no file" elsewhere in the transist.
     int saved = dup(0);
     close(0);
-    int fd = open_log_file("/data/run/kernel_log");
-    EXPECT_GT(fd, 0);
-    EXPECT_EQ(read_file("/data/run/kernel_log"), kHeader);
-    close(fd);
+    EXPECT_GT(fd = open_log_file("/data/run/kernel_log"), 0);
     dup2(saved, 0);
     close(saved);
+    if (fd > 0) close(fd);
 }
 
 TEST(RotationDue, OnlyPastTheLimit) {
@@ -96,42 +85,9 @@ TEST(RotationDue, OnlyPastTheLimit) {
         int64_t size;
         int limit_kb;
         bool due;
-    } cases[] = {
-        {1048000, 1024, false}, {1052000, 1024, true},  // 1027K
-        {1049599, 1024, false},                          // 1024K
-        {1049600, 1024, true},  {1023, 0, false},  {1024, 0, true},
-        {2147000000, 2147483647, true},  // never let the byte count overflow
-    };
-    for (const auto& c : cases)
-        EXPECT_EQ(rotation_due(c.size, c.limit_kb), c.due) << c.size << " bytes, limit " << c.limit_kb << "K";
-}
-
-TEST_F(LogFilesTest, WritesCountBytesAndRotateAfterTheNodeThatPassesTheLimit) {
-    open_entry(LOG_KERNEL, "/data/run/");
-    LogFile* entry = &log_files[LOG_KERNEL];
-    std::string first(1048000, 'a'), second(4000, 'b');
-    ASSERT_EQ(write_log_data(LOG_KERNEL, first.data(), static_cast<int>(first.size())), 1048000);
-    EXPECT_EQ(entry->size, 1048000);  // header not counted
-    EXPECT_FALSE(rotation_due(entry->size, rotate_limit_kb));
-    ASSERT_EQ(write_log_data(LOG_KERNEL, second.data(), static_cast<int>(second.size())), 4000);
-    EXPECT_EQ(entry->size, 1052000);
-    ASSERT_TRUE(rotation_due(entry->size, rotate_limit_kb));
-    ASSERT_EQ(rotate_log_files(entry), 0);
-    EXPECT_EQ(entry->size, 0);
-    EXPECT_EQ(read_file("/data/run/kernel_log.1"), kHeader + first + second);
-    EXPECT_EQ(read_file("/data/run/kernel_log"), kHeader);
-}
-
-TEST_F(LogFilesTest, RotatingOnlyXMakesXDot1AndAFreshX) {
-    open_entry(LOG_MAIN, "/data/run/");
-    ASSERT_EQ(write_log_data(LOG_MAIN, "old", 3), 3);
-    testing::internal::CaptureStderr();
-    ASSERT_EQ(rotate_log_files(&log_files[LOG_MAIN]), 0);
-    EXPECT_EQ(testing::internal::GetCapturedStderr(), "") << "missing older generations are normal";
-    EXPECT_EQ(files_in("/data/run"), (std::vector<std::string>{"main_log", "main_log.1"}));
-    EXPECT_EQ(read_file("/data/run/main_log.1"), kHeader + "old");
-    ASSERT_EQ(write_log_data(LOG_MAIN, "new", 3), 3);  // through the new descriptor
-    EXPECT_EQ(read_file("/data/run/main_log"), kHeader + "new");
+    } cases[] = {{1049599, 1024, false}, {1049600, 1024, true}, {1023, 0, false}, {1024, 0, true},
+                 {2147000000, 2147483647, true}};  // never let the byte count overflow
+    for (const auto& c : cases) EXPECT_EQ(rotation_due(c.size, c.limit_kb), c.due) << c.size << " " << c.limit_kb;
 }
 
 TEST_F(LogFilesTest, RotatingFiveGenerationsDropsTheOldest) {
@@ -140,46 +96,40 @@ TEST_F(LogFilesTest, RotatingFiveGenerationsDropsTheOldest) {
         write_file("/data/gen/radio_log." + std::to_string(gen), "gen" + std::to_string(gen));
     open_entry(LOG_RADIO, "/data/gen/");
     ASSERT_EQ(write_log_data(LOG_RADIO, "gen0", 4), 4);
+    EXPECT_EQ(log_files[LOG_RADIO].size, 4);  // the header is not counted
     ASSERT_EQ(rotate_log_files(&log_files[LOG_RADIO]), 0);
+    EXPECT_EQ(log_files[LOG_RADIO].size, 0);
     EXPECT_EQ(files_in("/data/gen"),
               (std::vector<std::string>{"radio_log", "radio_log.1", "radio_log.2", "radio_log.3", "radio_log.4"}));
     EXPECT_EQ(read_file("/data/gen/radio_log"), kHeader);
     EXPECT_EQ(read_file("/data/gen/radio_log.1"), kHeader + "gen0");
     for (int gen = 2; gen <= 4; gen++)
         EXPECT_EQ(read_file("/data/gen/radio_log." + std::to_string(gen)), "gen" + std::to_string(gen - 1));
+    ASSERT_EQ(write_log_data(LOG_RADIO, "new", 3), 3);  // through the new descriptor
+    EXPECT_EQ(read_file("/data/gen/radio_log"), kHeader + "new");
 }
 
-TEST_F(LogFilesTest, FailedReopenAfterRotationIsRecordedAndLeavesNoFile) {
+// A file that cannot be made or written leaves its type without a file, with one record.
+TEST_F(LogFilesTest, FailuresLeaveTheTypeWithoutFile) {
     mkdir("/data/gone", 0770);
     open_entry(LOG_EVENTS, "/data/gone/");
     ASSERT_EQ(system("rm -rf /data/gone"), 0);
     EXPECT_EQ(rotate_log_files(&log_files[LOG_EVENTS]), -1);
     EXPECT_EQ(log_files[LOG_EVENTS].fd, -1);
-    EXPECT_TRUE(history_has("couldn't open output file /data/gone/events_log,(2)"));
-}
+    open_run("/data/missing/", 1, 0, 1);
+    for (const LogFile& entry : log_files) EXPECT_EQ(entry.fd, -1);
+    char name[PATH_LEN];  // a folder without room for a file name
+    EXPECT_EQ(compose_log_name(name, ("/data/" + std::string(245, 'd') + "/").c_str(), LOG_MAIN), 0);
+    EXPECT_STREQ(name, "");
 
-TEST_F(LogFilesTest, FailedDataWritesAreRecordedOncePerFile) {
     write_file("/data/run/bt_log", "");
     LogFile* entry = &log_files[LOG_BT];
     ASSERT_EQ(compose_log_name(entry->name, "/data/run/", LOG_BT), 1);
     entry->fd = open(entry->name, O_RDONLY | O_CLOEXEC);  // every write fails
-    ASSERT_GT(entry->fd, 0);
     EXPECT_EQ(write_log_data(LOG_BT, "abc", 3), 0);
     EXPECT_EQ(write_log_data(LOG_BT, "def", 3), 0);
     EXPECT_EQ(entry->size, 0);
     EXPECT_EQ(count_of(read_file(kHistory), "write log data to /data/run/bt_log fail"), 1u);
-}
-
-TEST_F(LogFilesTest, OutputFilesFollowTheControllerSwitches) {
-    open_run("/data/run/", 0, 1, 0);
-    EXPECT_GT(log_files[LOG_KERNEL].fd, 0);
-    EXPECT_STREQ(log_files[LOG_KERNEL].name, "/data/run/kernel_log");
-    for (int type : {LOG_MAIN, LOG_RADIO, LOG_EVENTS, LOG_BT}) {
-        EXPECT_EQ(log_files[type].fd, -1) << type;
-        EXPECT_STREQ(log_files[type].name, "") << type;
-    }
-    EXPECT_EQ(files_in("/data/run"), std::vector<std::string>{"kernel_log"});
-    EXPECT_TRUE(history_has("open /data/run/kernel_log, fd = " + std::to_string(log_files[LOG_KERNEL].fd)));
 }
 
 // A link planted where a log file goes, or in place of the folder of a
@@ -189,7 +139,6 @@ TEST_F(LogFilesTest, PlantedLinksAreNeverWrittenThrough) {
     ASSERT_EQ(symlink("/data/target", "/data/run/kernel_log"), 0);
     open_run("/data/run/", 0, 1, 0);
     EXPECT_EQ(log_files[LOG_KERNEL].fd, -1);
-    EXPECT_TRUE(history_has("/data/run/kernel_log is a symbolic link, refused"));
 
     ASSERT_EQ(unlink("/data/run/kernel_log"), 0);
     open_entry(LOG_MAIN, "/data/run/");
@@ -199,29 +148,8 @@ TEST_F(LogFilesTest, PlantedLinksAreNeverWrittenThrough) {
     EXPECT_EQ(read_file("/data/target"), "autostart=0\n");
 }
 
-TEST_F(LogFilesTest, CreateFailuresUseEachTypesText) {
-    open_run("/data/missing/", 1, 0, 1);
-    for (const LogFile& entry : log_files) EXPECT_EQ(entry.fd, -1);
-    EXPECT_TRUE(history_has("Create /data/missing/main_log fail No such file or directory"));
-    EXPECT_TRUE(history_has("Create /data/missing/bt_log fail, No such file or directory"));
-    EXPECT_TRUE(history_has("open /data/missing/events_log, fd = -1"));
-
-    std::string folder = "/data/" + std::string(245, 'd') + "/";  // no room for a file name
-    char name[PATH_LEN];
-    EXPECT_EQ(compose_log_name(name, folder.c_str(), LOG_MAIN), 0);
-    EXPECT_STREQ(name, "");
-    open_run(folder.c_str(), 0, 1, 0);
-    EXPECT_EQ(log_files[LOG_KERNEL].fd, -1);
-    EXPECT_TRUE(history_has("log file path too long"));
-}
-
 TEST_F(LogFilesTest, ChangeFolderReopensExactlyTheOpenFiles) {
     mkdir("/data/next", 0770);
-    rotate_limit_kb = 512;  // without a run only the limit changes
-    change_log_folder("/data/next/", 1024);
-    EXPECT_TRUE(files_in("/data/next").empty());
-    EXPECT_TRUE(history_has("rotates size change from 512K to 1024K"));
-
     open_entry(LOG_MAIN, "/data/run/");
     open_entry(LOG_KERNEL, "/data/run/");
     ASSERT_EQ(write_log_data(LOG_MAIN, "before", 6), 6);
@@ -233,22 +161,15 @@ TEST_F(LogFilesTest, ChangeFolderReopensExactlyTheOpenFiles) {
     EXPECT_EQ(log_files[LOG_MAIN].size, 0);
     EXPECT_EQ(log_files[LOG_RADIO].fd, -1);
     EXPECT_EQ(rotate_limit_kb, 2048);
-    EXPECT_TRUE(history_has("rotates size change from 1024K to 2048K"));
     ASSERT_EQ(write_log_data(LOG_MAIN, "after", 5), 5);
     EXPECT_EQ(read_file("/data/next/main_log"), kHeader + "after");
-}
 
-TEST_F(LogFilesTest, ChangeFolderFailures) {
-    // A folder too long for the names: the current file is kept.
-    open_entry(LOG_BT, "/data/run/");
+    // A folder too long for the names keeps the current file; a missing one leaves none.
     change_log_folder(("/data/" + std::string(250, 'n') + "/").c_str(), 1024);
-    EXPECT_STREQ(log_files[LOG_BT].name, "/data/run/bt_log");
-    ASSERT_EQ(write_log_data(LOG_BT, "kept", 4), 4);
-    EXPECT_EQ(read_file("/data/run/bt_log"), kHeader + "kept");
-    // A missing folder: the type is left without a file.
+    ASSERT_EQ(write_log_data(LOG_MAIN, "kept", 4), 4);
+    EXPECT_EQ(read_file("/data/next/main_log"), kHeader + "afterkept");
     change_log_folder("/data/absent/", 1024);
-    EXPECT_EQ(log_files[LOG_BT].fd, -1);
-    EXPECT_TRUE(history_has("Change filename /data/absent/bt_log fail, errno = 2: No such file or directory"));
+    EXPECT_EQ(log_files[LOG_MAIN].fd, -1);
 }
 
 }  // namespace

@@ -10,6 +10,7 @@
 
 #include "collectors/kmsg_cat.h"
 #include "config/config_store.h"
+#include "core/boot_mode.h"
 #include "core/child_supervision.h"
 #include "core/log_controller.h"
 #include "test_util.h"
@@ -18,13 +19,6 @@
 namespace {
 
 const char* const kFifo = "/tmp/kmsg_fifo";
-
-// A log file's content after the writer's one-line timezone header.
-std::string log_body(const char* path) {
-    std::string text = read_file(path);
-    if (text.compare(0, 14, "-----timezone:") != 0) return "(no header) " + text;
-    return text.substr(text.find('\n') + 1);
-}
 
 TEST(CalcRotateSize, SplitsTheRunSizeOverItsFiles) {
     const struct {
@@ -61,78 +55,85 @@ TEST(RunSize, ZeroNegativeOrGarbageGiveTheDefault) {
     EXPECT_TRUE(history_has("logsize 0 is not a size in MB, 300 used"));
 }
 
-TEST(ComposeRunFolder, NamesTheFolderAfterTheStartTime) {
+// Every missing folder is made with group access whatever the umask; a file
+// or a planted link in the way, or a path without room, is refused.
+TEST(CreateRunFolder, CreatesEveryMissingFolderWithGroupAccessOrRefuses) {
+    umask(077);
+    LogController controller;
+    write_file("/data/blocker", "");
+    ASSERT_EQ(system("mkdir -p /data/elsewhere /mnt/sdcard/qrvlog && ln -s /data/elsewhere /mnt/sdcard/qrvlog/next"), 0);
+    const std::string too_long = "/data/" + std::string(249, 'y'), too_long_part = too_long.substr(0, 200);
+    const struct {
+        const char *base, *path;
+        int result;
+        const char* check;  // a folder that must then have mode 0770, or must not exist
+    } cases[] = {
+        {"/data", "/data/log_temp", 1, "/data/log_temp/"},
+        {"/data", "/data/log_temp/", 1, "/data/log_temp/"},  // existing: still success
+        {"/mnt/sdcard/deep", "/mnt/sdcard/deep/a/b/c", 1, "/mnt/sdcard/deep"},
+        {"/data", "/data/blocker/run", -1, "/data/blocker/run"},
+        {"/mnt/sdcard", "/mnt/sdcard/qrvlog/next/APLog_1/", -1, "/data/elsewhere/APLog_1"},
+        {"/data", too_long.c_str(), -1, too_long_part.c_str()},  // 255 characters: no room for '/' 
+    };
+    for (const auto& c : cases) {
+        EXPECT_EQ(create_run_folder(&controller, c.base, c.path), c.result) << c.path;
+        EXPECT_EQ(mode_of(c.check), c.result == 1 ? 0770u : 0u) << c.check;
+    }
+    EXPECT_EQ(mode_of("/mnt/sdcard/deep/a/b/c"), 0770u);
+}
+
+// The run's folder is named after its start time; a log path that leaves no
+// room for the name gives none, a folder too long for the property clears it.
+TEST(RunFolder, NamedAfterTheStartTimeAndPublished) {
     LogController controller;
     strcpy(controller.logpath, "/mnt/sdcard");
-    time_t before = time(nullptr);
+    time_t t = time(nullptr);
     compose_run_folder(&controller);
-    bool matched = false;
-    for (time_t t = before; t <= time(nullptr) && !matched; t++) {
-        struct tm tm;
+    std::string names;
+    for (struct tm tm; t <= time(nullptr); t++) {
         char name[64];
         strftime(name, sizeof(name), "/mnt/sdcard/qrvlog/tavlolog/APLog_%Y_%m%d_%H%M%S/", localtime_r(&t, &tm));
-        matched = std::string(name) == controller.run_folder;
+        names += std::string(name) + " ";
     }
-    EXPECT_TRUE(matched) << controller.run_folder;
-    EXPECT_TRUE(history_has(std::string("full path is:") + controller.run_folder));
-
-    // A log path that leaves no room gives no folder.
+    EXPECT_NE(names.find(std::string(controller.run_folder) + " "), std::string::npos) << controller.run_folder;
     strcpy(controller.logpath, ("/mnt/sdcard/" + std::string(230, 'x')).c_str());
     compose_run_folder(&controller);
     EXPECT_STREQ(controller.run_folder, "");
-    EXPECT_EQ(create_run_folder(&controller, controller.logpath, controller.run_folder), -1);
-}
-
-TEST(CreateRunFolder, CreatesEveryMissingFolderWithGroupAccessOrRefuses) {
-    umask(077);  // the modes do not depend on it
-    LogController controller;
-    const struct {
-        const char *base, *path, *created;  // the last folder, with its slash
-    } cases[] = {
-        {"/data", "/data/log_temp", "/data/log_temp/"},
-        {"/mnt/sdcard", "/mnt/sdcard/qrvlog/tavlolog/APLog_2026_0304_070649/",
-         "/mnt/sdcard/qrvlog/tavlolog/APLog_2026_0304_070649/"},
-        {"/mnt/sdcard/deep", "/mnt/sdcard/deep/a/b/c", "/mnt/sdcard/deep/a/b/c/"},
-        {"/data", "/data/log_temp", "/data/log_temp/"},  // existing: still success
-    };
-    for (const auto& c : cases) {
-        EXPECT_EQ(create_run_folder(&controller, c.base, c.path), 1) << c.path;
-        EXPECT_EQ(mode_of(c.created), 0770u) << c.created;
-        EXPECT_TRUE(history_has(std::string("mkdir ") + c.created + " success")) << c.created;
-    }
-    EXPECT_EQ(mode_of("/mnt/sdcard/deep"), 0770u);
-    EXPECT_EQ(mode_of("/mnt/sdcard/qrvlog"), 0770u);
-
-    write_file("/data/blocker", "");
-    EXPECT_EQ(create_run_folder(&controller, "/data", "/data/blocker/run"), -1);
-    EXPECT_TRUE(history_has("mkdir /data/blocker fails, errno:Not a directory(20)"));
-    EXPECT_TRUE(history_has("mkdir /data/blocker/run/ fails at last"));
-
-    // A link planted on the card (the log path itself may be one).
-    ASSERT_EQ(system("mkdir /data/elsewhere && ln -s /data/elsewhere /mnt/sdcard/qrvlog/next"), 0);
-    EXPECT_EQ(create_run_folder(&controller, "/mnt/sdcard", "/mnt/sdcard/qrvlog/next/APLog_1/"), -1);
-    EXPECT_TRUE(files_in("/data/elsewhere").empty());
-
-    std::string too_long = "/data/" + std::string(249, 'y');  // 255 characters, no room for '/'
-    EXPECT_EQ(create_run_folder(&controller, "/data", too_long.c_str()), -1);
-    EXPECT_FALSE(exists(too_long.substr(0, 200)));
-    EXPECT_TRUE(history_has("refused: longer than 255 characters"));
-}
-
-TEST(PublishRunFolder, AFolderTooLongForThePropertyClearsIt) {
-    LogController controller;
     publish_run_folder(&controller, "/mnt/sdcard/qrvlog/tavlolog/APLog_2026_0304_070649/");
     EXPECT_EQ(property(PROP_REALPATH), "/mnt/sdcard/qrvlog/tavlolog/APLog_2026_0304_070649/");
-    std::string long_folder = "/mnt/" + std::string(90, 'd') + "/qrvlog/tavlolog/APLog_2026_0304_070650/";
-    publish_run_folder(&controller, long_folder.c_str());
+    publish_run_folder(&controller, ("/mnt/" + std::string(90, 'd') + "/qrvlog/tavlolog/APLog_2026_0304_070650/").c_str());
     EXPECT_EQ(property(PROP_REALPATH), "") << "the earlier run's folder would receive this run's records";
-    EXPECT_TRUE(history_has("set debug.TQ.realpath to " + long_folder + " failed"));
 }
 
 TEST(SignalChild, NeverSignalsTheDaemonsOwnGroup) {
     // kill(0, ...) would reach this process: SIGUSR1 would end the test.
     signal_child(0, SIGUSR1);
     signal_child(-1, SIGUSR1);
+}
+
+// Only the first character counts; odd content is recorded with what was read.
+TEST(BootMode, FirstCharacterOfTheFile) {
+    const struct {
+        const char* content;  // nullptr: no file
+        int mode;
+        const char* record;  // "": nothing recorded
+    } cases[] = {
+        {"0", 0, ""},
+        {"1\n", 1, ""},
+        {"7", 7, ""},
+        {"10", 1, "boot mode file /tmp/boot_mode holds 2 odd byte(s), boot mode 1"},
+        {"x", 0, "boot mode file /tmp/boot_mode holds 1 odd byte(s), boot mode 0"},
+        {"", 0, "boot mode file /tmp/boot_mode holds 0 odd byte(s), boot mode 0"},
+        {"\xff\xfe binary", 0, "boot mode file /tmp/boot_mode holds 8 odd byte(s), boot mode 0"},
+        {nullptr, -1, "Failed to open boot mode file /tmp/boot_mode"},
+    };
+    for (const auto& c : cases) {
+        unlink(kHistory);
+        unlink("/tmp/boot_mode");
+        if (c.content != nullptr) write_file("/tmp/boot_mode", c.content);
+        EXPECT_EQ(read_boot_mode("/tmp/boot_mode"), c.mode) << c.record;
+        EXPECT_TRUE(c.record[0] ? history_has(c.record) : read_file(kHistory).empty()) << read_file(kHistory);
+    }
 }
 
 class RunTest : public ::testing::Test {
@@ -179,8 +180,6 @@ TEST_F(RunTest, StopKeepsEverythingTheCollectorSent) {
     EXPECT_EQ(property(PROP_RUNNING), "1");
     EXPECT_EQ(property(PROP_LOGSIZE), "12288");
     ASSERT_GT(controller_.klog_pid, 0);
-    EXPECT_TRUE(history_has("M(0),R(0),E(0),K(" + std::to_string(controller_.klog_pid) + "),B(0)"));
-
     std::string sent;
     for (int i = 0; i < 400; i++) sent += "<6>[" + std::to_string(i) + ".000000] a line of the kernel log, some padding\n";
     feed(sent);
@@ -194,9 +193,7 @@ TEST_F(RunTest, StopKeepsEverythingTheCollectorSent) {
         feed(last);
     });
     pid_t collector = controller_.klog_pid;
-    long long t0 = monotonic_ms();
     stop_logging(&controller_);
-    EXPECT_LT(monotonic_ms() - t0, 3000);
     late.join();
     ASSERT_TRUE(wait_source_drained()) << "the collector ended before the late words came";
     sent += last;
@@ -204,10 +201,8 @@ TEST_F(RunTest, StopKeepsEverythingTheCollectorSent) {
     EXPECT_EQ(property(PROP_RUNNING), "0");
     EXPECT_EQ(controller_.klog_pid, 0);
     EXPECT_EQ(controller_.shm, nullptr);
-    std::string body = log_body("/data/run_test/kernel_log");
-    EXPECT_TRUE(body == sent) << body.size() << " of " << sent.size() << " bytes";
-    for (const char* record : {"read thread exit ", "write thread exit ", "tavlolog stop done"})
-        EXPECT_TRUE(history_has(record)) << record;
+    std::string body = read_file("/data/run_test/kernel_log");
+    EXPECT_TRUE(body == "-----timezone: GMT\n" + sent) << body.size() << " of " << sent.size() << " bytes";
     EXPECT_NE(kill(collector, 0), 0) << "the stop left a collector behind";
 }
 
@@ -221,57 +216,16 @@ std::string fd_target(pid_t pid, int fd) {
 // clients' connections open: they would outlive the daemon's own close.
 TEST_F(RunTest, CollectorKeepsNoneOfTheDaemonsDescriptors) {
     start_logging(&controller_);
-    ASSERT_GT(controller_.klog_pid, 0);
     feed("x\n");
     ASSERT_TRUE(wait_source_drained());
-
-    const std::string forbidden[] = {fd_target(getpid(), transist_listen_fd), fd_target(getpid(), client_[0]),
-                                     fd_target(getpid(), log_files[LOG_KERNEL].fd)};
-    for (const std::string& target : forbidden) ASSERT_NE(target, "");
-    int open_count = 0;
-    for (int fd = 0; fd < 1024; fd++) {
-        std::string target = fd_target(controller_.klog_pid, fd);
-        if (target.empty()) continue;
-        open_count++;
-        for (const std::string& bad : forbidden) EXPECT_NE(target, bad) << "fd " << fd;
+    std::string held = "\n";
+    for (int fd = 0; fd < 1024; fd++) held += fd_target(controller_.klog_pid, fd) + "\n";
+    for (int fd : {transist_listen_fd, client_[0], log_files[LOG_KERNEL].fd}) {
+        std::string target = fd_target(getpid(), fd);
+        ASSERT_NE(target, "");
+        EXPECT_EQ(held.find("\n" + target + "\n"), std::string::npos) << target;
     }
-    EXPECT_GT(open_count, 0);
-}
-
-TEST_F(RunTest, SwitchMovesTheRunningFilesToTheNewFolder) {
-    start_logging(&controller_);
-    feed("first\n");
-    ASSERT_TRUE(wait_source_drained());
-    ASSERT_EQ(create_run_folder(&controller_, "/data", "/data/run_moved/"), 1);
-    controller_.rotate_size_kb = 512;
-    switch_run_folder(&controller_, "/data/run_moved/");
-    EXPECT_EQ(property(PROP_REALPATH), "/data/run_moved/");
-    EXPECT_EQ(property(PROP_LOGSIZE), "512");
-    feed("second\n");
-    ASSERT_TRUE(wait_source_drained());
-    stop_logging(&controller_);
-    EXPECT_EQ(log_body("/data/run_test/kernel_log") + log_body("/data/run_moved/kernel_log"), "first\nsecond\n");
-    EXPECT_NE(log_body("/data/run_moved/kernel_log").find("second\n"), std::string::npos);
-}
-
-TEST_F(RunTest, StopWithNoCollectorToWaitForIsQuick) {
-    controller_.kernel_log = 0;
-    start_logging(&controller_);
-    EXPECT_TRUE(history_has("M(0),R(0),E(0),K(0),B(0)"));
-    check_children(&controller_);  // finds no collector: changes nothing
-    EXPECT_TRUE(history_has("all processes die, no need to check"));
-    EXPECT_EQ(property(PROP_RUNNING), "1");
-    long long t0 = monotonic_ms();
-    stop_logging(&controller_);
-    EXPECT_LT(monotonic_ms() - t0, 1000) << "one poll, not nine";
-    EXPECT_TRUE(history_has("tavlolog stop done"));
-
-    unlink(kHistory);  // a second stop only records
-    controller_.log_path_state = 1;
-    stop_logging(&controller_);
-    EXPECT_EQ(controller_.log_path_state, -1);
-    EXPECT_TRUE(history_has("tavlolog already stopped, ignore this stop"));
-    EXPECT_FALSE(history_has("tavlolog stop done"));
+    EXPECT_NE(held.find("socket:"), std::string::npos) << "no descriptors seen";
 }
 
 // A run held in /data while the card is gone: until the writer has ended it
@@ -295,22 +249,17 @@ TEST_F(RunTest, StopLeavesNoFalseOrStaleStorageNotice) {
     EXPECT_EQ(read(efd_thread, &notice, sizeof(notice)), -1) << "a stale notice would stop the next run";
 }
 
-// A collector that ends with a reason is reported with it; the last one to end
-// stops the run and every client hears of it.
+// A collector that cannot open its source ends with its reason; being the
+// last one, its death stops the run and every client hears of it.
 TEST_F(RunTest, CollectorThatCannotOpenItsSourceStopsTheRun) {
     KmsgCat::kmsg_path = "/tmp/no_such_kmsg";
     start_logging(&controller_);
     struct pollfd p = {efd_chld, POLLIN, 0};  // the SIGCHLD notice, as the control loop waits for it
-    int ready;
-    while ((ready = poll(&p, 1, 5000)) < 0 && errno == EINTR) {
-    }
-    ASSERT_EQ(ready, 1);
     uint64_t count;
+    ASSERT_TRUE(wait_for([&] { return poll(&p, 1, 0) == 1; }, 5000));
     ASSERT_EQ(read(efd_chld, &count, sizeof(count)), 8);
     check_children(&controller_);
-    for (const char* record : {"kLog dies unexpectly", "oru warning comes,type is 10", "all chil processes die"})
-        EXPECT_TRUE(history_has(record)) << record;
-    EXPECT_EQ(controller_.klog_pid, 0);
+    EXPECT_TRUE(history_has("oru warning comes,type is 10"));
     EXPECT_EQ(property(PROP_RUNNING), "0");
     char buf[64] = {};
     EXPECT_GT(recv(client_[1], buf, sizeof(buf) - 1, MSG_DONTWAIT), 0);

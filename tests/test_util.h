@@ -84,12 +84,6 @@ inline bool has_record(const std::string& message) {
     return std::find(all.begin(), all.end(), message) != all.end();
 }
 
-inline long long monotonic_ms() {
-    struct timespec ts;
-    clock_gettime(CLOCK_MONOTONIC, &ts);
-    return ts.tv_sec * 1000LL + ts.tv_nsec / 1000000;
-}
-
 // Polls cond every 10 ms for at most ms milliseconds.
 inline bool wait_for(const std::function<bool()>& cond, int ms) {
     for (int waited = 0; !cond(); waited += 10) {
@@ -124,13 +118,6 @@ inline mode_t mode_of(const std::string& path) {
 inline ino_t inode_of(const std::string& path) {
     struct stat st;
     return stat(path.c_str(), &st) == 0 ? st.st_ino : 0;
-}
-
-// True when a thread of this process carries name (threads are named for top and /proc).
-inline bool has_thread(const char* name) {
-    for (const std::string& tid : files_in("/proc/self/task"))
-        if (read_file("/proc/self/task/" + tid + "/comm") == std::string(name) + "\n") return true;
-    return false;
 }
 
 // Runs a shell command line; returns its exit status and its output.
