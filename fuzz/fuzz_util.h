@@ -1,35 +1,36 @@
-// What the harnesses share: their bounds from the command line or the
-// environment, a printed seed, and escaped input in failure reports.
+// The driver every randomized harness runs on: a fixed seed printed first, a
+// bounded number of rounds, and on a failure the round, the seed and the
+// round's input (escaped), so that it can be replayed:
+//
+//   NAME_fuzz [ROUNDS [SEED]]   (or TAVLO_FUZZ_ROUNDS, TAVLO_FUZZ_SEED)
+//
+// The harnesses write the emulated phone's /data, so they run only inside one.
 #pragma once
 
 #include <stdio.h>
 #include <stdlib.h>
-#include <time.h>
 #include <unistd.h>
 
+#include <random>
 #include <string>
 
-inline double fuzz_now() {
-    struct timespec ts;
-    clock_gettime(CLOCK_MONOTONIC, &ts);
-    return static_cast<double>(ts.tv_sec) + static_cast<double>(ts.tv_nsec) / 1e9;
-}
+struct Fuzz {
+    std::mt19937_64 rng;
+    unsigned long round = 0;
+    std::string input;  // what the round works on, shown when it fails
 
-// NAME [SECONDS [SEED]], or TAVLO_FUZZ_SECONDS and TAVLO_FUZZ_SEED. Prints the
-// seed so that a failure can be replayed; exits when not inside the emulated
-// phone, since the harnesses write its /data.
-inline void fuzz_start(const char* name, int argc, char** argv, double* seconds, unsigned long* seed) {
-    if (access("/dev/emu/properties", F_OK) != 0) {
-        fprintf(stderr, "%s: run it inside the emulated phone (tools/tavlo-emu sandbox)\n", name);
-        exit(2);
+    size_t pick(size_t n) { return n == 0 ? 0 : static_cast<size_t>(rng() % n); }
+    // n characters of alphabet (of any byte when it is null).
+    std::string bytes(size_t n, const char* alphabet = nullptr, size_t alphabet_len = 0) {
+        std::string s(n, '\0');
+        for (char& c : s) c = alphabet ? alphabet[pick(alphabet_len)] : static_cast<char>(rng());
+        return s;
     }
-    const char* env_seconds = getenv("TAVLO_FUZZ_SECONDS");
-    const char* env_seed = getenv("TAVLO_FUZZ_SEED");
-    if (argc > 1 || env_seconds) *seconds = atof(argc > 1 ? argv[1] : env_seconds);
-    if (argc > 2 || env_seed) *seed = strtoul(argc > 2 ? argv[2] : env_seed, nullptr, 0);
-    printf("%s: seed %lu, %.1f s\n", name, *seed, *seconds);
-    fflush(stdout);
-}
+    // Up to max of them.
+    std::string text(size_t max, const char* alphabet = nullptr, size_t alphabet_len = 0) {
+        return bytes(pick(max + 1), alphabet, alphabet_len);
+    }
+};
 
 inline std::string fuzz_printable(const std::string& s) {
     std::string out;
@@ -39,4 +40,33 @@ inline std::string fuzz_printable(const std::string& s) {
         out += hex;
     }
     return out;
+}
+
+// Runs round(f) ROUNDS times; a round returns nullptr when it passed, else what failed.
+inline int fuzz_main(const char* name, int argc, char** argv, unsigned long seed, unsigned long rounds,
+                     const char* (*round)(Fuzz& f)) {
+    if (access("/dev/emu/properties", F_OK) != 0) {
+        fprintf(stderr, "%s: run it inside the emulated phone (tools/tavlo-emu sandbox)\n", name);
+        return 2;
+    }
+    const char* env_rounds = getenv("TAVLO_FUZZ_ROUNDS");
+    const char* env_seed = getenv("TAVLO_FUZZ_SEED");
+    if (argc > 1 || env_rounds) rounds = strtoul(argc > 1 ? argv[1] : env_rounds, nullptr, 0);
+    if (argc > 2 || env_seed) seed = strtoul(argc > 2 ? argv[2] : env_seed, nullptr, 0);
+    printf("%s: seed %lu, %lu rounds\n", name, seed, rounds);
+    fflush(stdout);
+    Fuzz f;
+    f.rng.seed(seed);
+    for (; f.round < rounds; f.round++) {
+        f.input.clear();
+        if (const char* failed = round(f)) {
+            // On standard output: a harness may have silenced standard error.
+            printf("%s: FAILED in round %lu (seed %lu): %s\ninput (%zu bytes): \"%s\"\n", name, f.round, seed,
+                   failed, f.input.size(), fuzz_printable(f.input.substr(0, 4096)).c_str());
+            fflush(stdout);
+            abort();
+        }
+    }
+    printf("%s: %lu rounds, no failure\n", name, rounds);
+    return 0;
 }
