@@ -59,29 +59,27 @@ TEST_F(LogPathTest, ValueBecomesADirectory) {
     }
 }
 
-TEST_F(LogPathTest, OverrideRewritesTheFileAndStaysAfterItIsCleared) {
-    ASSERT_EQ(property_set(kOverride, "/data"), 0);  // also when the file is recreated
-    load_logpath();
-    EXPECT_EQ(read_file(CONFIG_FILE), config_with_logpath("/data"));
-
-    write_file(CONFIG_FILE, config_with_logpath("internal_sd"));
-    ASSERT_EQ(property_set(kOverride, "external_sd"), 0);
+// The override property, when set and different, rewrites the file's logpath.
+TEST_F(LogPathTest, OverrideRewritesTheFileOnlyWhenItDiffers) {
     ASSERT_EQ(property_set("external_sd_path", "/storage/sdcard1"), 0);
-    EXPECT_EQ(load_logpath(), "/storage/sdcard1");
-    EXPECT_EQ(read_file(CONFIG_FILE), config_with_logpath("external_sd"));
-    ASSERT_EQ(property_set(kOverride, ""), 0);
-    load_logpath();
-    EXPECT_EQ(read_file(CONFIG_FILE), config_with_logpath("external_sd"));
-}
-
-TEST_F(LogPathTest, OverrideUnsetOrEqualLeavesTheFileAlone) {
-    for (const char* value : {"", "/data"}) {
-        write_file(CONFIG_FILE, config_with_logpath("/data"));
+    const struct {
+        const char *override, *before, *path, *after;  // before nullptr: no file
+    } cases[] = {
+        {"/data", nullptr, "/data", "/data"},  // also when the file is made anew
+        {"external_sd", "internal_sd", "/storage/sdcard1", "external_sd"},
+        {"", "/data", "/data", "/data"},
+        {"/data", "/data", "/data", "/data"},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.override);
+        unlink(CONFIG_FILE);
+        if (c.before) write_file(CONFIG_FILE, config_with_logpath(c.before));
         ino_t before = inode_of(CONFIG_FILE);
-        if (value[0]) { ASSERT_EQ(property_set(kOverride, value), 0); }
-        EXPECT_EQ(load_logpath(), "/data");
-        EXPECT_EQ(inode_of(CONFIG_FILE), before) << value;
-        EXPECT_EQ(read_file(CONFIG_FILE), config_with_logpath("/data"));
+        ASSERT_EQ(property_set(kOverride, c.override), 0);
+        EXPECT_EQ(load_logpath(), c.path);
+        EXPECT_EQ(read_file(CONFIG_FILE), config_with_logpath(c.after));
+        bool same = c.before && strcmp(c.before, c.after) == 0;
+        EXPECT_TRUE(!same || inode_of(CONFIG_FILE) == before) << "rewritten without a change";
     }
 }
 

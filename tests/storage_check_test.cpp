@@ -34,23 +34,26 @@ TEST_F(StorageCheckTest, FreeSpaceIsAvailableBlocksTimesBlockSize) {
     EXPECT_TRUE(history_messages().empty());
 }
 
-TEST_F(StorageCheckTest, MissingPathFailsOnceAndIsLow) {
-    const std::string failed = "Failed to get the file status of /mnt/nosuchcard, errno=2";
-    EXPECT_EQ(get_free_space("/mnt/nosuchcard", 3), 0u);
-    EXPECT_EQ(history_messages(), Records{failed});
-    unlink(kHistory);
-    EXPECT_EQ(is_storage_low("/mnt/nosuchcard"), 1);
-    EXPECT_EQ(history_messages(), (Records{failed, "/mnt/nosuchcard is almost full or unavailable!!"}));
-}
-
-// procfs reports zero blocks, as an unmounted card does.
-TEST_F(StorageCheckTest, FileSystemWithoutBlocksIsRetriedThenGivenUp) {
+// A missing path fails at once; a file system without blocks (procfs, as an
+// unmounted card) is retried, then given up. Either is low.
+TEST_F(StorageCheckTest, UnavailablePathIsLow) {
     const std::string retry = "SD card is unavailable!! Retrying!", gave_up = "SD card is unavailable! We have retried!";
-    EXPECT_EQ(get_free_space("/proc", 2), 0u);
-    EXPECT_EQ(history_messages(), (Records{retry, retry, retry, gave_up}));
-    unlink(kHistory);
-    EXPECT_EQ(is_storage_low("/proc"), 1);
-    EXPECT_EQ(history_messages(), (Records{retry, gave_up, "/proc is almost full or unavailable!!"}));
+    const std::string missing = "Failed to get the file status of /mnt/nosuchcard, errno=2";
+    const struct {
+        const char* path;
+        Records get_records, low_records;
+    } cases[] = {
+        {"/mnt/nosuchcard", {missing}, {missing, "/mnt/nosuchcard is almost full or unavailable!!"}},
+        {"/proc", {retry, retry, retry, gave_up}, {retry, gave_up, "/proc is almost full or unavailable!!"}},
+    };
+    for (const auto& c : cases) {
+        unlink(kHistory);
+        EXPECT_EQ(get_free_space(c.path, 2), 0u);  // up to two retries
+        EXPECT_EQ(history_messages(), c.get_records);
+        unlink(kHistory);
+        EXPECT_EQ(is_storage_low(c.path), 1);
+        EXPECT_EQ(history_messages(), c.low_records);
+    }
 }
 
 TEST_F(StorageCheckTest, WarningRecordsDependOnTypeAndEncryption) {
