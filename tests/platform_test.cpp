@@ -1,5 +1,4 @@
 // The emulated phone's platform log (/dev/emu/wlog) and system properties.
-#include <atomic>
 #include <thread>
 
 #include "common/wlog.h"
@@ -166,33 +165,6 @@ TEST_F(Properties, PersistentPropertiesAreStoredWhole) {
     EXPECT_LT(property_set("persist.emu.kept", "new"), 0);
     EXPECT_EQ(property("persist.emu.kept"), "value 2") << "a value that cannot be stored is not set either";
     ASSERT_EQ(rename("/data/property.away", PROPERTY_PERSIST_DIR), 0);
-}
-
-// Threads and processes replace one key with a letter repeated 91 times;
-// readers only ever see one whole such value.
-TEST_F(Properties, ConcurrentSetsNeverShowTornValues) {
-    auto write_and_read = [](char letter) {
-        bool ok = true;
-        for (int i = 0; i < 150; i++) {
-            ok = property_set("debug.emu.torn", std::string(91, letter).c_str()) == 0 && ok;
-            std::string v = property("debug.emu.torn");
-            ok = v.size() == 91 && v[0] >= 'A' && v[0] <= 'F' && v == std::string(91, v[0]) && ok;
-        }
-        return ok;
-    };
-    std::vector<pid_t> children;
-    for (char letter : {'E', 'F'}) {
-        pid_t pid = fork();
-        if (pid == 0) _exit(write_and_read(letter) ? 0 : 1);
-        children.push_back(pid);
-    }
-    std::atomic<int> failed{0};
-    std::vector<std::thread> threads;
-    for (char letter : {'A', 'B', 'C', 'D'}) threads.emplace_back([&, letter] { failed += write_and_read(letter) ? 0 : 1; });
-    for (auto& t : threads) t.join();
-    for (pid_t pid : children) EXPECT_TRUE(exits_with(pid, 0, 30000));
-    EXPECT_EQ(failed.load(), 0);
-    EXPECT_EQ(files_in(PROPERTY_AREA_DIR).size(), 1u) << "every temporary file was renamed away";
 }
 
 }  // namespace
