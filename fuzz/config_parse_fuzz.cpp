@@ -1,7 +1,6 @@
-// Randomized harness for the configuration parser: lines of keys, '=', runs of
-// spaces and line feeds, values around the length limit and random bytes go
-// through trim and config_parse_line and, as whole files of either kind,
-// config_read_file; each result is checked against a small model of the syntax.
+// Random configuration lines and files (keys, '=', spaces, line feeds, values
+// around the length limit, any bytes) through trim, config_parse_line and
+// config_read_file, checked against a small model of the syntax.
 #include <fcntl.h>
 #include <string.h>
 #include <unistd.h>

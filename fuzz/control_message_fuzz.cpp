@@ -1,8 +1,6 @@
-// Randomized harness for the control socket's command and configuration-message
-// handling: random, structured and mutated messages go through
-// handle_client_message on a socket pair; each reply and the configuration
-// file are checked against a small model of the protocol's rules.
-// Commands that start a run are not sent (their handling is the run's, not the parser's).
+// Random and mutated control messages through handle_client_message; each reply
+// and the configuration file checked against a model of the protocol's rules.
+// Commands that start a run are not sent: their handling is the run's.
 #include <string.h>
 #include <sys/socket.h>
 

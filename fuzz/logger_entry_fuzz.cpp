@@ -1,10 +1,7 @@
-// Randomized harness for what the Android collector does with the bytes of
-// one read: random, mutated and well-formed entries (text and binary events)
-// are queued on two text devices and an events device, then decoded and
-// formatted through the platform library. Checked: an entry is taken exactly
-// when it is whole, every queue stays in time order with arrival order among
-// equal times, the count of held entries matches the queues, and the library
-// never reads or writes out of bounds (under the sanitizers).
+// Random, mutated and whole entries of one read queued on two text devices and
+// an events device, then formatted: an entry is taken exactly when whole, the
+// queues keep time order (arrival order among equal times) and their count,
+// and nothing is read or written out of bounds (under the sanitizers).
 #include <fcntl.h>
 #include <stdint.h>
 

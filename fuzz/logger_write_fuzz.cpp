@@ -1,11 +1,7 @@
-// Randomized harness for the logger devices' write path: random writes (empty,
-// small, over the payload limit) and random injection writes (valid, unknown
-// or absent buffers, truncated headers, binary noise) into small rings that
-// wrap all the time, with readers that open at any moment and read at their
-// own pace. Every result, every entry read and the rings' positions are
-// checked against a plain model: a list of every entry ever written, of which
-// a ring keeps the longest tail that fits. One round: fresh rings and 2000
-// operations on them.
+// Writes and injections (empty, oversized, unknown buffers, cut headers, noise)
+// into small rings that wrap all the time, read at any pace by readers opened
+// at any moment; checked against a list of every entry ever written, of which
+// a ring keeps the longest tail that fits. A round: fresh rings, 2000 steps.
 #include <string.h>
 #include <time.h>
 
