@@ -1,11 +1,10 @@
-// Copies of a holding folder onto the card, and the boot-copy wait that makes one.
+// Copies of a holding folder onto the card (the boot-copy wait is run end to end by the boot scenarios).
 #include "storage/log_copy.h"
 
 #include <sys/resource.h>
 
 #include <map>
 
-#include "core/control_socket.h"
 #include "core/log_controller.h"
 #include "test_util.h"
 
@@ -68,27 +67,6 @@ TEST(CopyLogFolder, AppendsOldestPieceFirstAndKeepsWhatCannotGo) {
         EXPECT_EQ(c.kept, files_in(kHeld));
         for (const std::string& name : c.kept) EXPECT_EQ(c.held.count(name) ? c.held.at(name) : "", read_file(kHeld + name));
     }
-}
-
-// A boot run nobody asked about: after the wait its logs go to a BOOTFAIL_ folder.
-TEST(BootFailCopy, RunsWhenTheWaitEnds) {
-    ASSERT_EQ(0, system("mkdir -p /data/log_temp /data/misc/tqlog"));
-    write_file("/data/log_temp/kernel_log", "held\n");
-    LogController* controller = new LogController();  // lives as long as the process, as the daemon's does
-    strcpy(controller->logpath, "/mnt/sdcard");
-    controller->kernel_log = 1;
-    controller->sd_log_path = 1;
-    controller->boot_mode = 1;  // no exception-engine switch
-    controller->boot_copy_timer = 1;
-    boot_copy_timeout_s = 1;
-    start_control_socket(controller);
-    ASSERT_TRUE(wait_for([] { return has_record("boot copy complete!"); }, 10000)) << read_file(kHistory);
-    std::vector<std::string> runs = files_in("/mnt/sdcard/qrvlog/tavlolog");
-    ASSERT_EQ(1u, runs.size());
-    EXPECT_EQ(0u, runs[0].find("BOOTFAIL_"));
-    EXPECT_EQ(N + "held\n", read_file("/mnt/sdcard/qrvlog/tavlolog/" + runs[0] + "/kernel_log.boot"));
-    EXPECT_FALSE(exists("/data/log_temp"));
-    EXPECT_EQ(runs[0] + " 0\n", read_file("/data/misc/tqlog/inter_sd_folder"));
 }
 
 }  // namespace

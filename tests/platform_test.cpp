@@ -1,4 +1,4 @@
-// The emulated phone's platform log (/dev/emu/wlog) and system properties.
+// The platform log writer, and the emulated phone's system properties as the daemon reads them.
 #include <thread>
 
 #include "common/wlog.h"
@@ -111,23 +111,6 @@ class Properties : public ::testing::Test {
     }
 };
 
-TEST_F(Properties, KeysFollowThePropertyServiceRules) {
-    const std::string k31(31, 'k'), k32(32, 'k');
-    const char* legal[] = {"a", k31.c_str(), "debug.TQ.running", "a:b@c-d_e.f9"};
-    const char* illegal[] = {k32.c_str(), "", ".hidden", "trailing.", "two..dots", "a/b", "../escape",
-                             "with space", "tab\there", "caf\xc3\xa9", "new\nline", nullptr};
-    for (const char* key : legal) EXPECT_TRUE(property_set(key, "v") == 0 && property(key, "-") == "v") << key;
-    for (const char* key : illegal) {
-        EXPECT_LT(property_set(key, "v"), 0) << (key ? key : "null");
-        if (key) {
-            EXPECT_EQ(property(key, "-"), "-") << key;
-        }
-    }
-    EXPECT_EQ(files_in(PROPERTY_AREA_DIR).size(), 4u) << "nothing else reached the folder";
-    EXPECT_FALSE(exists("/dev/emu/escape"));
-    EXPECT_LT(property_set("a", nullptr), 0);
-}
-
 TEST_F(Properties, ValuesAndDefaultsAreCutNeverOverrun) {
     EXPECT_EQ(property_set("debug.v", std::string(91, 'x').c_str()), 0);
     EXPECT_LT(property_set("debug.v", std::string(92, 'y').c_str()), 0);
@@ -149,22 +132,6 @@ TEST_F(Properties, ValuesAndDefaultsAreCutNeverOverrun) {
         EXPECT_STREQ(value, c.value) << c.key;
         EXPECT_EQ(value[PROPERTY_VALUE_MAX], '#') << c.key;
     }
-}
-
-TEST_F(Properties, PersistentPropertiesAreStoredWhole) {
-    mode_t old = umask(077);  // the modes must not depend on the caller's umask
-    EXPECT_EQ(property_set("persist.emu.kept", "value 1"), 0);
-    EXPECT_EQ(property_set("persist.emu.kept", "value 2"), 0);
-    umask(old);
-    EXPECT_EQ(read_file(PROPERTY_PERSIST_DIR "/persist.emu.kept"), "value 2");
-    EXPECT_EQ(mode_of(PROPERTY_PERSIST_DIR "/persist.emu.kept"), 0600u);
-    EXPECT_EQ(mode_of(PROPERTY_AREA_DIR "/persist.emu.kept"), 0664u);
-    EXPECT_EQ(property_set("debug.emu.not_kept", "x"), 0);
-    EXPECT_EQ(files_in(PROPERTY_PERSIST_DIR), Lines{"persist.emu.kept"}) << "no temporary file, no other prefix";
-    ASSERT_EQ(rename(PROPERTY_PERSIST_DIR, "/data/property.away"), 0);
-    EXPECT_LT(property_set("persist.emu.kept", "new"), 0);
-    EXPECT_EQ(property("persist.emu.kept"), "value 2") << "a value that cannot be stored is not set either";
-    ASSERT_EQ(rename("/data/property.away", PROPERTY_PERSIST_DIR), 0);
 }
 
 }  // namespace
