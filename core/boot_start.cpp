@@ -168,8 +168,13 @@ int start_in_temp_folder(LogController* controller) {
         return 1;
     }
     data_storage_low = 0;
-    // What an earlier boot left there was not wanted on the card.
-    if (exists(TEMP_FOLDER)) {
+    // What an earlier boot left there was not wanted on the card; what this
+    // boot's earlier daemon held there is, and is appended to.
+    char booted[PROPERTY_VALUE_MAX];
+    property_get(PROP_BOOTED, booted, "0");
+    if (strcmp(booted, "1") == 0) {
+        if (exists(TEMP_FOLDER)) HLOG(TAG_MAIN, WLOG_ERROR, "restarted within this boot, %s kept", TEMP_FOLDER);
+    } else if (exists(TEMP_FOLDER)) {
         UniqueFd data(safe_open_dir("/data", "/data", false, 0));
         if (!data.ok() || safe_remove_tree(data.get(), "log_temp") != 0) {
             int err = errno;
@@ -180,6 +185,7 @@ int start_in_temp_folder(LogController* controller) {
         HLOG(TAG_MAIN, WLOG_ERROR, "mkdir %s faild,errno=%d", TEMP_FOLDER, errno);
         return 0;
     }
+    property_set(PROP_BOOTED, "1");
     return 1;
 }
 

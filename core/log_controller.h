@@ -74,6 +74,9 @@ extern int data_storage_low;
 #define PROP_RUNNING "debug.TQ.running"
 #define PROP_REALPATH "debug.TQ.realpath"
 #define PROP_LOGSIZE "debug.TQ.logsize"
+// Set once a daemon of this boot has made /data/log_temp: a daemon restarted
+// by init finds the same boot's held logs there and keeps them.
+#define PROP_BOOTED "debug.TQ.booted"
 
 // The size of a run in MB from a logsize value; one that is not a positive
 // number is recorded and gives the default.
