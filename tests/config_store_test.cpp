@@ -1,5 +1,6 @@
 // The configuration store on the phone's real paths.
 #include "config/config_store.h"
+#include "storage/folder_records.h"
 
 #include <sys/resource.h>
 
@@ -9,6 +10,8 @@ namespace {
 
 const char kDefaultFile[] =
     "autostart=0\nlogpath=internal_sd\nlogsize=300\nAndroidLog=1\nKernelLog=1\nBTLog=1\ntotallogsize=600\n";
+
+const char kRecords[] = "/data/misc/tqlog/inter_sd_folder";
 
 std::string default_file_with(const std::string& line) {
     std::string out = kDefaultFile;
@@ -84,19 +87,26 @@ TEST_F(ConfigStoreTest, LoadRecreatesAnUnreadableFileFromTheCache) {
     EXPECT_EQ(read_file(CONFIG_FILE), default_file_with("BTLog=0"));
 }
 
-// The file is written aside and renamed: a failed write never leaves half a file.
+// The configuration and the folder records are written aside and renamed: a
+// failed write never leaves half a file.
 TEST_F(ConfigStoreTest, FailedWriteKeepsTheOldFileWhole) {
     write_file(CONFIG_FILE, kDefaultFile);
+    write_file(kRecords, "A 1\n");
     config_update_item(&cache_, "logsize", "123");
+    const std::string records = "APLog_2026_0304_070649 10\nAPLog_2026_0304_070650 20\n";
+    FolderRecord* list = parse_folder_records(records.data(), records.size());
     signal(SIGXFSZ, SIG_IGN);  // the size limit fails the third line with EFBIG
     struct rlimit old_limit;
     getrlimit(RLIMIT_FSIZE, &old_limit);
     struct rlimit small = {40, old_limit.rlim_max};
     ASSERT_EQ(setrlimit(RLIMIT_FSIZE, &small), 0);
-    int rc = config_write(&cache_);
+    int rc = config_write(&cache_), records_rc = write_folder_records(list, "NEW", 1);
     setrlimit(RLIMIT_FSIZE, &old_limit);
+    free_folder_records(list);
     EXPECT_EQ(rc, -1);
+    EXPECT_NE(records_rc, 1);
     EXPECT_EQ(read_file(CONFIG_FILE), kDefaultFile);
+    EXPECT_EQ(read_file(kRecords), "A 1\n");
     EXPECT_FALSE(exists(CONFIG_FILE ".tmp"));
 
     symlink("/data/elsewhere", CONFIG_FILE ".tmp");  // a stale temporary link is replaced, not followed
