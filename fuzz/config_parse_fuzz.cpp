@@ -1,9 +1,7 @@
-// Random configuration lines and files (keys, '=', spaces, line feeds, values
-// around the length limit, any bytes) through trim, config_parse_line and
+// Random configuration lines and files through trim, config_parse_line and
 // config_read_file, checked against a small model of the syntax.
 #include <fcntl.h>
 #include <string.h>
-#include <unistd.h>
 
 #include <vector>
 

@@ -1,6 +1,5 @@
-// Random and mutated control messages through handle_client_message; each reply
-// and the configuration file checked against a model of the protocol's rules.
-// Commands that start a run are not sent: their handling is the run's.
+// Random control messages (but those starting a run) through handle_client_message;
+// each reply and the configuration file checked against a model of the rules.
 #include <string.h>
 #include <sys/socket.h>
 

@@ -1,10 +1,5 @@
-// The driver every randomized harness runs on: a fixed seed printed first, a
-// bounded number of rounds, and on a failure the round, the seed and the
-// round's input (escaped), so that it can be replayed:
-//
-//   NAME_fuzz [ROUNDS [SEED]]   (or TAVLO_FUZZ_ROUNDS, TAVLO_FUZZ_SEED)
-//
-// The harnesses write the emulated phone's /data, so they run only inside one.
+// The randomized harnesses' driver: a fixed seed printed first, bounded rounds, and on a failure
+// the round, seed and input to replay it: NAME_fuzz [ROUNDS [SEED]] (or TAVLO_FUZZ_ROUNDS, _SEED).
 #pragma once
 
 #include <stdio.h>

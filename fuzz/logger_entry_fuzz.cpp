@@ -1,7 +1,6 @@
-// Random, mutated and whole entries of one read queued on two text devices and
-// an events device, then formatted: an entry is taken exactly when whole, the
-// queues keep time order (arrival order among equal times) and their count,
-// and nothing is read or written out of bounds (under the sanitizers).
+// Random, mutated and whole entries queued on two text devices and an events
+// device, then formatted: an entry is taken exactly when whole, the queues keep
+// time order (arrival order among equal times) and their count.
 #include <fcntl.h>
 #include <stdint.h>
 
@@ -10,8 +9,7 @@
 
 namespace {
 
-// The library reports every entry it cannot decode on standard error; that
-// goes to /dev/null, and sanitizer reports to the real one.
+// The library's complaints go to /dev/null, sanitizer reports to standard error.
 extern "C" void __sanitizer_set_report_fd(void* fd) __attribute__((weak));
 
 void silence_library() {

@@ -1,7 +1,6 @@
-// Writes and injections (empty, oversized, unknown buffers, cut headers, noise)
-// into small rings that wrap all the time, read at any pace by readers opened
-// at any moment; checked against a list of every entry ever written, of which
-// a ring keeps the longest tail that fits. A round: fresh rings, 2000 steps.
+// Writes into small rings that wrap all the time, read at any pace by readers
+// opened at any moment; checked against a list of every entry written, of
+// which a ring keeps the longest tail that fits.
 #include <string.h>
 #include <time.h>
 
@@ -62,30 +61,6 @@ const char* device_write(Fuzz& f, int b) {
     return nullptr;
 }
 
-const char* inject_write(Fuzz& f) {
-    static const char* const names[] = {"main", "system", "radio", "events", "kernel", "", "mainx"};
-    std::string name = names[f.pick(7)];
-    switch (f.pick(4)) {
-        case 0: f.input = f.text(64); break;
-        case 1: f.input = name + f.text(40); break;
-        default: f.input = name + '\0' + f.bytes(LOGGER_HEADER_LEN + random_len(f));
-    }
-    const std::string& bytes = f.input;
-    long taken = logger_inject_write(rings, bytes.data(), bytes.size());
-
-    // The model's reading of the same bytes.
-    size_t nul = bytes.find('\0');
-    int b = nul != std::string::npos && nul < 16 ? logger_buffer_by_name(bytes.c_str()) : -1;
-    if (b < 0 || rings[b] == nullptr || bytes.size() - nul - 1 < LOGGER_HEADER_LEN)
-        return taken == -1 ? nullptr : "injection of bad bytes accepted";
-    LoggerHeader h;
-    memcpy(&h, bytes.data() + nul + 1, sizeof(h));
-    std::string payload = bytes.substr(nul + 1 + LOGGER_HEADER_LEN, LOGGER_MAX_PAYLOAD);
-    if (taken != static_cast<long>(nul + 1 + LOGGER_HEADER_LEN + payload.size())) return "injection took a wrong length";
-    if (!payload.empty()) models[b].add(entry_of(h, payload));
-    return nullptr;
-}
-
 const char* read_some(Fuzz& f, int b, int r) {
     Model& m = models[b];
     LoggerRing& ring = *rings[b];
@@ -108,12 +83,10 @@ const char* read_some(Fuzz& f, int b, int r) {
 }
 
 const char* one_round(Fuzz& f) {
-    // Rings of sizes that wrap after a few entries; "system" is sometimes absent.
+    // Rings of sizes that wrap after a few entries.
     LoggerRing fresh[LOGGER_BUFFER_COUNT];
     for (int b = 0; b < LOGGER_BUFFER_COUNT; b++) {
-        rings[b] = nullptr;
         models[b] = Model();
-        if (b == LOGGER_SYSTEM && f.pick(3) == 0) continue;
         size_t size = LOGGER_MIN_SIZE + f.pick(3 * LOGGER_MAX_ENTRY);
         if (!fresh[b].init(size)) return "ring init failed";
         rings[b] = &fresh[b];
@@ -122,11 +95,9 @@ const char* one_round(Fuzz& f) {
     }
     for (int step = 0; step < 2000; step++) {
         int b = static_cast<int>(f.pick(LOGGER_BUFFER_COUNT));
-        if (rings[b] == nullptr) b = LOGGER_MAIN;
         const char* failed = nullptr;
         switch (f.pick(5)) {
-            case 0: failed = device_write(f, b); break;
-            case 1: failed = inject_write(f); break;
+            case 0: case 1: failed = device_write(f, b); break;
             case 2: {
                 // A reader opens anew: at the oldest kept entry.
                 int r = static_cast<int>(f.pick(READERS));

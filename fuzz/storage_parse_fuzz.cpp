@@ -1,6 +1,5 @@
-// Syntax-heavy bytes (long lines, NUL bytes, spaces, names that climb) through
-// the dump list and folder record parsers, checked against small models;
-// parsed records are also written and read back.
+// Syntax-heavy bytes through the dump list and folder record parsers, checked
+// against small models; parsed records are also written and read back.
 #include <limits.h>
 #include <sys/stat.h>
 

@@ -15,12 +15,10 @@ class StorageCheckTest : public ::testing::Test {
     }
 };
 
+// Above 4 GiB: a 32-bit wrap would make these low.
 TEST(FreeSpaceThreshold, BelowTenMebibytesIsLow) {
-    // Above 4 GiB: a 32-bit wrap would make these low.
-    const uint64_t enough[] = {10485760, (4ULL << 30) + 4096, 64ULL << 30, UINT64_MAX};
-    for (uint64_t bytes : enough) EXPECT_EQ(is_free_space_low(bytes), 0) << bytes;
-    EXPECT_EQ(is_free_space_low(10485759), 1);
-    EXPECT_EQ(is_free_space_low(0), 1);
+    for (uint64_t bytes : {10485760ULL, (4ULL << 30) + 4096, 0xffffffffffffffffULL}) EXPECT_EQ(is_free_space_low(bytes), 0) << bytes;
+    for (uint64_t bytes : {10485759ULL, 0ULL}) EXPECT_EQ(is_free_space_low(bytes), 1) << bytes;
 }
 
 // A missing path fails at once; a file system without blocks (procfs, as an
@@ -51,7 +49,6 @@ TEST_F(StorageCheckTest, WarningRecordsDependOnTypeAndEncryption) {
         const char* encrypt_progress;  // "": unset
         Records records;
     } cases[] = {
-        {-1, "", {}},
         {-1, "42", {}},
         {5, "", {"prop:vold.encrypt_progress,temp:", "oru warning comes,type is 5", "out put to log file failed"}},
         {11, "", {"prop:vold.encrypt_progress,temp:", "oru warning comes,type is 11", "sdcard is full"}},
