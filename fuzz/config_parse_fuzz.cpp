@@ -35,19 +35,13 @@ std::string line(Fuzz& f) {
     return s;
 }
 
-std::string model_trim(const std::string& s) {
-    size_t len = s.size(), start = 0;
-    while (len > 1 && (s[len - 1] == ' ' || s[len - 1] == '\n')) len--;
-    while (start < len && s[start] == ' ') start++;
-    return s.substr(start, len - start);
-}
-
 // A line of the daemon's file (source 0) or of the system defaults (1).
 void model_parse(int source, const std::string& line) {
     std::string s = line.substr(0, std::min(line.find('\0'), size_t{254}));
     size_t eq = s.find('=');
     if (eq == std::string::npos || eq == 0 || eq + 1 == s.size()) return;
-    std::string key = model_trim(s.substr(0, eq)), value = model_trim(s.substr(eq + 1));
+    std::string key = fuzz_skip_spaces(fuzz_trimmed(s.substr(0, eq)));
+    std::string value = fuzz_skip_spaces(fuzz_trimmed(s.substr(eq + 1)));
     if (source == 1) {
         if (key == KEYS[7]) value = value == "true" ? "1" : "0";
         key = key == KEYS[7] ? KEYS[0] : key == KEYS[8] ? KEYS[2] : key == KEYS[9] ? KEYS[1] : "";
@@ -87,7 +81,8 @@ const char* one_round(Fuzz& f) {
     std::vector<char> buf(c_string.begin(), c_string.end());
     buf.insert(buf.end(), {'\0', '#', '#', '#', '#'});
     char* trimmed = trim(buf.data());
-    if (trimmed < buf.data() || trimmed > buf.data() + c_string.size() || trimmed != model_trim(c_string))
+    if (trimmed < buf.data() || trimmed > buf.data() + c_string.size() ||
+        trimmed != fuzz_skip_spaces(fuzz_trimmed(c_string)))
         return "trim differs from the model";
     if (std::string(buf.end() - 4, buf.end()) != "####") return "trim wrote past the string";
 

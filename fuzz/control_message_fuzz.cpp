@@ -38,21 +38,11 @@ std::string message(Fuzz& f) {
     return m.substr(0, CONTROL_MSG_MAX);
 }
 
-std::string trimmed(std::string s) {
-    while (s.size() > 1 && (s.back() == ' ' || s.back() == '\n')) s.pop_back();
-    return s;
-}
-
-std::string skip_spaces(const std::string& s) {
-    size_t lead = s.find_first_not_of(' ');
-    return lead == std::string::npos ? "" : s.substr(lead);
-}
-
 // The reply suffix the rules give, and the item the message stores (-1: none).
 const char* expect(const std::string& text, bool inner_nul, int* item, std::string* value) {
     *item = -1;
     if (inner_nul) return REPLY_FAILED;
-    std::string m = skip_spaces(trimmed(text));
+    std::string m = fuzz_skip_spaces(fuzz_trimmed(text));
     size_t eq = m.find('=');
     if (eq == std::string::npos) return REPLY_DONE;
     std::string key = m.substr(0, eq);
@@ -103,15 +93,15 @@ const char* one_round(Fuzz& f) {
     std::string want, value;
     int item = -1;
     if (command == CONTROL_CONFIG) {
-        want = trimmed(upto_nul) + expect(upto_nul, upto_nul.size() < text.size(), &item, &value);
+        want = fuzz_trimmed(upto_nul) + expect(upto_nul, upto_nul.size() < text.size(), &item, &value);
     } else {
         want = command == CONTROL_STOP ? "stop,1" : "deep_stop,1";
         if (command == CONTROL_DEEP_STOP) item = 0, value = "0";
     }
     // A change rewrites the file from what was read back, which the
     // reader trims; an equal value leaves the file alone.
-    if (item >= 0 && trimmed(skip_spaces(values[item])) != value) {
-        for (std::string& v : values) v = trimmed(skip_spaces(v));
+    if (item >= 0 && fuzz_trimmed(fuzz_skip_spaces(values[item])) != value) {
+        for (std::string& v : values) v = fuzz_trimmed(fuzz_skip_spaces(v));
         values[item] = value;
     }
     if (got != want) return "reply differs from the model";

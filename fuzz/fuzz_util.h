@@ -1,5 +1,5 @@
 // The randomized harnesses' driver: a fixed seed printed first, bounded rounds, and on a failure
-// the round, seed and input to replay it: NAME_fuzz [ROUNDS [SEED]] (or TAVLO_FUZZ_ROUNDS, _SEED).
+// the round, seed and input to replay it: NAME_fuzz [ROUNDS [SEED]].
 #pragma once
 
 #include <stdio.h>
@@ -27,14 +27,15 @@ struct Fuzz {
     }
 };
 
-inline std::string fuzz_printable(const std::string& s) {
-    std::string out;
-    for (unsigned char c : s) {
-        char hex[8];
-        snprintf(hex, sizeof(hex), c >= 0x20 && c < 0x7f && c != '\\' ? "%c" : "\\x%02x", c);
-        out += hex;
-    }
-    return out;
+// Without trailing spaces and line feeds (but the first character), as the daemon trims.
+inline std::string fuzz_trimmed(std::string s) {
+    while (s.size() > 1 && (s.back() == ' ' || s.back() == '\n')) s.pop_back();
+    return s;
+}
+
+inline std::string fuzz_skip_spaces(const std::string& s) {
+    size_t lead = s.find_first_not_of(' ');
+    return lead == std::string::npos ? "" : s.substr(lead);
 }
 
 // Runs round(f) ROUNDS times; a round returns nullptr when it passed, else what failed.
@@ -44,10 +45,8 @@ inline int fuzz_main(const char* name, int argc, char** argv, unsigned long seed
         fprintf(stderr, "%s: run it inside the emulated phone (tools/tavlo-emu sandbox)\n", name);
         return 2;
     }
-    const char* env_rounds = getenv("TAVLO_FUZZ_ROUNDS");
-    const char* env_seed = getenv("TAVLO_FUZZ_SEED");
-    if (argc > 1 || env_rounds) rounds = strtoul(argc > 1 ? argv[1] : env_rounds, nullptr, 0);
-    if (argc > 2 || env_seed) seed = strtoul(argc > 2 ? argv[2] : env_seed, nullptr, 0);
+    if (argc > 1) rounds = strtoul(argv[1], nullptr, 0);
+    if (argc > 2) seed = strtoul(argv[2], nullptr, 0);
     printf("%s: seed %lu, %lu rounds\n", name, seed, rounds);
     fflush(stdout);
     Fuzz f;
@@ -55,9 +54,15 @@ inline int fuzz_main(const char* name, int argc, char** argv, unsigned long seed
     for (; f.round < rounds; f.round++) {
         f.input.clear();
         if (const char* failed = round(f)) {
-            // On standard output: a harness may have silenced standard error.
+            // On standard output (a harness may have silenced standard error), the input escaped.
+            std::string shown;
+            for (unsigned char c : f.input.substr(0, 4096)) {
+                char hex[8];
+                snprintf(hex, sizeof(hex), c >= 0x20 && c < 0x7f && c != '\\' ? "%c" : "\\x%02x", c);
+                shown += hex;
+            }
             printf("%s: FAILED in round %lu (seed %lu): %s\ninput (%zu bytes): \"%s\"\n", name, f.round, seed,
-                   failed, f.input.size(), fuzz_printable(f.input.substr(0, 4096)).c_str());
+                   failed, f.input.size(), shown.c_str());
             fflush(stdout);
             abort();
         }

@@ -27,7 +27,8 @@ std::vector<std::string> lines(const std::string& text, bool keep_feed) {
 
 bool plain_name(const std::string& n) { return !n.empty() && n.find('/') == std::string::npos && n != "." && n != ".."; }
 
-// Not comments, split at spaces, output names that are one file name and fit; last line first.
+// Not comments, split at spaces, output names that are one file name and fit, kinds as written;
+// last line first.
 std::vector<std::string> dump_model(const std::string& text, const std::string& run) {
     std::vector<std::string> out;
     for (const std::string& line : lines(text, false)) {
@@ -64,12 +65,12 @@ std::vector<std::string> records_of(FolderRecord* list) {
 }
 
 const char* one_round(Fuzz& f) {
-    static const std::string pieces[] = {" ", "  ", "\n", "#", "/src", "out", "sys_prop", "..", "/", ".",
+    static const std::string pieces[] = {" ", "  ", "\n", "#", "/src", "out", "sys_prop", "SYS_PROP", "..", "/", ".",
                                          std::string(1, '\0'), "APLog_2026_0304_070649", "-7", "99999999999"};
     if (f.round == 0) mkdir("/data/misc", 0771);
     for (size_t n = f.pick(80); n > 0; n--) {
         size_t k = f.pick(8);
-        f.input += k == 0 ? std::string(f.pick(300), "sx /1"[f.pick(5)]) : k == 1 ? f.bytes(1) : pieces[f.pick(14)];
+        f.input += k == 0 ? std::string(f.pick(300), "sx /1"[f.pick(5)]) : k == 1 ? f.bytes(1) : pieces[f.pick(15)];
     }
     const std::string& text = f.input;
     std::string run = "/mnt/sdcard/" + std::string(f.pick(250), 'r') + "/";

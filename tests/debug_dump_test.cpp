@@ -1,4 +1,4 @@
-// The dump list as the device's file gives it, and the dump into a run folder.
+// The dump into a run folder, from the default list and from the device's own.
 #include "storage/debug_dump.h"
 
 #include "test_util.h"
@@ -7,22 +7,6 @@ namespace {
 
 const std::string kRun = "/mnt/sdcard/run/";
 const std::string kFooter = "================ END of FILE ===============\n\n";
-
-// "source>output name:kind" of each entry, in dump order.
-std::vector<std::string> entries_of(DumpEntry* list) {
-    std::vector<std::string> out;
-    for (DumpEntry* e = list; e != nullptr; e = e->next)
-        out.push_back(std::string(e->source) + ">" + (e->output + e->name_at) + (e->dumper == dump_properties ? ":P" : ":F"));
-    free_dump_list(list);
-    return out;
-}
-
-// The randomized harness checks the syntax; here the kinds and the order.
-TEST(ParseDumpListText, LastLineFirstAndKindsAsWritten) {
-    const std::string text = "/a out\n#/c\n/x y sys_prop extra\n/p q SYS_PROP\n/b\n";
-    EXPECT_EQ(entries_of(parse_dump_list_text(text.data(), text.size(), "/mnt/sdcard", kRun.c_str())),
-              (std::vector<std::string>{"/b>properties:F", "/p>q:F", "/x>y:P", "/a>out:F"}));
-}
 
 // Section headers of a dump output, in order.
 std::vector<std::string> headers_of(const std::string& path) {
