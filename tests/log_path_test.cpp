@@ -6,8 +6,6 @@
 
 namespace {
 
-const char kOverride[] = "persist.qrvlog.log2sd.path";
-
 std::string config_with_logpath(const std::string& logpath) {
     return "autostart=0\nlogpath=" + logpath + "\nlogsize=300\nAndroidLog=1\nKernelLog=1\nBTLog=1\ntotallogsize=600\n";
 }
@@ -20,21 +18,11 @@ class LogPathTest : public ::testing::Test {
         // persist. properties keep a copy in /data/property, as on the phone.
         ASSERT_EQ(system("rm -rf /data/* /dev/emu/properties/* && mkdir -p /data/property /data/misc/tqlog"), 0);
     }
-    std::string load_logpath() {
-        ConfigCache cache;
-        config_init(&cache);
-        config_load(&cache);
-        return config_get(&cache, "logpath");
-    }
 };
 
 TEST_F(LogPathTest, ValueBecomesADirectory) {
     const struct {
-        const char* value;
-        const char* internal_prop;  // "": unset
-        const char* external_prop;
-        const char* expected;
-        const char* record;  // "": none
+        const char *value, *internal_prop, *external_prop, *expected, *record;  // "": unset, none
     } cases[] = {
         {"internal_sd", "/storage/emulated/0", "", "/storage/emulated/0", ""},
         {"internal_sd", "", "/storage/ext", "/mnt/sdcard", "cant get log path through property internal_sd_path"},
@@ -75,8 +63,11 @@ TEST_F(LogPathTest, OverrideRewritesTheFileOnlyWhenItDiffers) {
         unlink(CONFIG_FILE);
         if (c.before) write_file(CONFIG_FILE, config_with_logpath(c.before));
         ino_t before = inode_of(CONFIG_FILE);
-        ASSERT_EQ(property_set(kOverride, c.override), 0);
-        EXPECT_EQ(load_logpath(), c.path);
+        ASSERT_EQ(property_set("persist.qrvlog.log2sd.path", c.override), 0);
+        ConfigCache cache;
+        config_init(&cache);
+        config_load(&cache);
+        EXPECT_STREQ(config_get(&cache, "logpath"), c.path);
         EXPECT_EQ(read_file(CONFIG_FILE), config_with_logpath(c.after));
         bool same = c.before && strcmp(c.before, c.after) == 0;
         EXPECT_TRUE(!same || inode_of(CONFIG_FILE) == before) << "rewritten without a change";
