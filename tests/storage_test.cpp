@@ -26,7 +26,6 @@ class SafeFileTest : public ::testing::Test {
                   0);
         umask(077);  // modes must not depend on it
     }
-    void TearDown() override { umask(0); }
 };
 
 TEST_F(SafeFileTest, FolderChainBelowTheRoot) {
@@ -227,14 +226,6 @@ TEST(RunDebugDump, FramesEachSourceAndTheProperties) {
     EXPECT_TRUE(has_record("/tmp/fifo is not a regular file, not dumped"));
 }
 
-class StorageCheckTest : public ::testing::Test {
-  protected:
-    void SetUp() override {
-        SKIP_OUTSIDE_PHONE();
-        ASSERT_EQ(system("rm -rf /data/* /dev/emu/properties/* && mkdir -p /data/misc/tqlog"), 0);
-    }
-};
-
 // Above 4 GiB: a 32-bit wrap would make these low.
 TEST(FreeSpaceThreshold, BelowTenMebibytesIsLow) {
     for (uint64_t bytes : {10485760ULL, (4ULL << 30) + 4096, 0xffffffffffffffffULL}) EXPECT_EQ(is_free_space_low(bytes), 0) << bytes;
@@ -243,7 +234,8 @@ TEST(FreeSpaceThreshold, BelowTenMebibytesIsLow) {
 
 // A missing path fails at once; a file system without blocks (procfs, as an
 // unmounted card) is retried, then given up. Either is low.
-TEST_F(StorageCheckTest, UnavailablePathIsLow) {
+TEST(StorageCheck, UnavailablePathIsLow) {
+    SKIP_OUTSIDE_PHONE();
     const std::string retry = "SD card is unavailable!! Retrying!", gave_up = "SD card is unavailable! We have retried!";
     const std::string missing = "Failed to get the file status of /mnt/nosuchcard, errno=2";
     const struct {
@@ -263,7 +255,8 @@ TEST_F(StorageCheckTest, UnavailablePathIsLow) {
     }
 }
 
-TEST_F(StorageCheckTest, WarningRecordsDependOnTypeAndEncryption) {
+TEST(StorageCheck, WarningRecordsDependOnTypeAndEncryption) {
+    SKIP_OUTSIDE_PHONE();
     const struct {
         int type;
         const char* encrypt_progress;  // "": unset
@@ -276,7 +269,7 @@ TEST_F(StorageCheckTest, WarningRecordsDependOnTypeAndEncryption) {
         {5, "42", {"prop:vold.encrypt_progress,temp:42", "phone is encryping, will not show red screen:42"}},
     };
     for (const auto& c : cases) {
-        SetUp();
+        ASSERT_EQ(system("rm -f /dev/emu/properties/* /data/misc/tqlog/tqlog_history"), 0);
         if (c.encrypt_progress[0]) { ASSERT_EQ(property_set("vold.encrypt_progress", c.encrypt_progress), 0); }
         report_system_warning(c.type);
         EXPECT_EQ(history_messages(), c.records) << c.type;
