@@ -1,8 +1,8 @@
 // Random configuration lines and files through trim, config_parse_line and
 // config_read_file, checked against a small model of the syntax.
-#include <fcntl.h>
 #include <string.h>
 
+#include <fstream>
 #include <vector>
 
 #include "config/config_store.h"
@@ -98,9 +98,7 @@ const char* one_round(Fuzz& f) {
     for (size_t n = f.pick(40); n > 0; n--) f.input += line(f);
     int source = static_cast<int>(f.pick(2));
     const char* path = source == 0 ? CONFIG_FILE : SYSTEM_DEFAULTS_FILE;
-    int fd = open(path, O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
-    bool written = fd >= 0 && write(fd, f.input.data(), f.input.size()) == static_cast<ssize_t>(f.input.size());
-    if (fd < 0 || close(fd) != 0 || !written) return "cannot write the file";
+    if (!(std::ofstream(path, std::ios::binary) << f.input)) return "cannot write the file";
     reset();
     model_read(source, f.input);
     if (config_read_file(&cache, path) != 1 || cache.source != source) return "file not read as its kind";

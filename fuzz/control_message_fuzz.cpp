@@ -3,6 +3,8 @@
 #include <string.h>
 #include <sys/socket.h>
 
+#include <fstream>
+
 #include "common/control_protocol.h"
 #include "config/config_store.h"
 #include "config/log_path.h"
@@ -61,14 +63,6 @@ const char* expect(const std::string& text, bool inner_nul, int* item, std::stri
     return REPLY_DONE;
 }
 
-std::string read_all(const char* path) {
-    std::string out;
-    FILE* f = fopen(path, "r");
-    for (int c; f && (c = fgetc(f)) != EOF;) out += static_cast<char>(c);
-    if (f) fclose(f);
-    return out;
-}
-
 const char* one_round(Fuzz& f) {
     if (f.round == 0) {
         controller.boot_mode = 1;  // no exception-engine tool
@@ -107,7 +101,8 @@ const char* one_round(Fuzz& f) {
     if (got != want) return "reply differs from the model";
     std::string file;
     for (int i = 0; i < CONFIG_ITEM_COUNT; i++) file += std::string(KEYS[i]) + "=" + values[i] + "\n";
-    return read_all(CONFIG_FILE) == file ? nullptr : "configuration file differs from the model";
+    std::ifstream in(CONFIG_FILE);
+    return std::string(std::istreambuf_iterator<char>(in), {}) == file ? nullptr : "configuration file differs from the model";
 }
 
 }  // namespace

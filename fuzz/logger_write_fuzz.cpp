@@ -42,13 +42,6 @@ size_t random_len(Fuzz& f) {
     return lens[f.pick(4)];
 }
 
-std::string entry_of(const LoggerHeader& header, const std::string& payload) {
-    LoggerHeader h = header;
-    h.len = static_cast<uint16_t>(payload.size());
-    h.pad = 0;
-    return std::string(reinterpret_cast<const char*>(&h), sizeof(h)) + payload;
-}
-
 const char* device_write(Fuzz& f, int b) {
     std::string bytes = f.bytes(random_len(f));
     struct timespec now = {static_cast<time_t>(f.rng() & 0x7fffffff), static_cast<long>(f.pick(1000000000))};
@@ -56,8 +49,9 @@ const char* device_write(Fuzz& f, int b) {
     size_t kept = logger_device_write(rings[b], pid, tid, now, bytes.data(), bytes.size());
     std::string payload = bytes.substr(0, LOGGER_MAX_PAYLOAD);
     if (kept != payload.size()) return "device write kept a wrong length";
-    LoggerHeader h = {0, 0, pid, tid, static_cast<int32_t>(now.tv_sec), static_cast<int32_t>(now.tv_nsec)};
-    if (!payload.empty()) models[b].add(entry_of(h, payload));
+    LoggerHeader h = {static_cast<uint16_t>(payload.size()), 0, pid, tid, static_cast<int32_t>(now.tv_sec),
+                      static_cast<int32_t>(now.tv_nsec)};
+    if (!payload.empty()) models[b].add(std::string(reinterpret_cast<const char*>(&h), sizeof(h)) + payload);
     return nullptr;
 }
 

@@ -66,12 +66,11 @@ TEST_F(ConfigTest, FailedWriteKeepsTheOldFileWhole) {
     const std::string records = "APLog_2026_0304_070649 10\nAPLog_2026_0304_070650 20\n";
     FolderRecord* list = parse_folder_records(records.data(), records.size());
     signal(SIGXFSZ, SIG_IGN);  // the size limit fails the third line with EFBIG
-    struct rlimit old_limit;
-    getrlimit(RLIMIT_FSIZE, &old_limit);
-    struct rlimit small = {40, old_limit.rlim_max};
-    ASSERT_EQ(setrlimit(RLIMIT_FSIZE, &small), 0);
+    struct rlimit limit = {40, RLIM_INFINITY};
+    ASSERT_EQ(setrlimit(RLIMIT_FSIZE, &limit), 0);
     int rc = config_write(&cache_), records_rc = write_folder_records(list, "NEW", 1);
-    setrlimit(RLIMIT_FSIZE, &old_limit);
+    limit.rlim_cur = RLIM_INFINITY;
+    setrlimit(RLIMIT_FSIZE, &limit);
     free_folder_records(list);
     EXPECT_EQ(rc, -1);
     EXPECT_NE(records_rc, 1);
