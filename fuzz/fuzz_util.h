@@ -15,13 +15,12 @@ struct Fuzz {
     std::string input;  // what the round works on, shown when it fails
 
     size_t pick(size_t n) { return n == 0 ? 0 : static_cast<size_t>(rng() % n); }
-    // n characters of alphabet (of any byte when it is null).
+    // n characters of alphabet (of any byte when it is null); text: up to max of them.
     std::string bytes(size_t n, const char* alphabet = nullptr, size_t alphabet_len = 0) {
         std::string s(n, '\0');
         for (char& c : s) c = alphabet ? alphabet[pick(alphabet_len)] : static_cast<char>(rng());
         return s;
     }
-    // Up to max of them.
     std::string text(size_t max, const char* alphabet = nullptr, size_t alphabet_len = 0) {
         return bytes(pick(max + 1), alphabet, alphabet_len);
     }

@@ -12,15 +12,6 @@ namespace {
 // The library's complaints go to /dev/null, sanitizer reports to standard error.
 extern "C" void __sanitizer_set_report_fd(void* fd) __attribute__((weak));
 
-void silence_library() {
-    int report_fd = dup(2);
-    int null_fd = open("/dev/null", O_WRONLY | O_CLOEXEC);
-    if (report_fd < 0 || null_fd < 0) return;
-    if (__sanitizer_set_report_fd) __sanitizer_set_report_fd(reinterpret_cast<void*>(static_cast<intptr_t>(report_fd)));
-    dup2(null_fd, 2);
-    close(null_fd);
-}
-
 void put32(std::string& s, size_t at, uint32_t v) {
     for (int i = 0; i < 4; i++) s[at + i] = static_cast<char>(v >> (8 * i));
 }
@@ -63,7 +54,8 @@ bool wild_queued = false;
 
 const char* one_round(Fuzz& f) {
     if (f.round == 0) {
-        silence_library();
+        if (__sanitizer_set_report_fd) __sanitizer_set_report_fd(reinterpret_cast<void*>(static_cast<intptr_t>(dup(2))));
+        if (!freopen("/dev/null", "w", stderr)) return "no /dev/null";
         cat = new LogCat("main_log");
         cat->transist_fd = open("/dev/null", O_WRONLY | O_CLOEXEC);
         if (cat->transist_fd < 0 || !cat->set_output_format()) return "no output format";

@@ -23,9 +23,7 @@ class ConfigTest : public ::testing::Test {
     void SetUp() override {
         SKIP_OUTSIDE_PHONE();
         umask(0);  // as the daemon: modes are exactly those given at creation
-        // persist. properties keep a copy in /data/property, as on the phone.
-        ASSERT_EQ(system("rm -rf /data/* /system/etc/* /dev/emu/properties/* && "
-                         "mkdir -p /data/property /data/misc/tqlog"), 0);
+        ASSERT_EQ(system("rm -rf /data/misc /system/etc/* /dev/emu/properties/* && mkdir -p /data/misc/tqlog"), 0);
         config_init(&cache_);
     }
     ConfigCache cache_;

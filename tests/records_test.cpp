@@ -153,9 +153,7 @@ TEST_F(HistoryLogTest, ForkedChildRecordsWhileAThreadHoldsTheLock) {
         _exit(0);
     }
     bool child_done = exits_with(child, 0, 10000);
-    int fifo = open(kProperty, O_WRONLY);  // lets the writer go on
-    EXPECT_EQ(write(fifo, kRunFolder, strlen(kRunFolder)), static_cast<ssize_t>(strlen(kRunFolder)));
-    close(fifo);
+    write_file(kProperty, kRunFolder);  // lets the writer go on
     writer.join();
     history_log(0, "parent after");
     unsetenv("TZ");

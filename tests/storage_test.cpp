@@ -22,8 +22,7 @@ class SafeFileTest : public ::testing::Test {
     void SetUp() override {
         SKIP_OUTSIDE_PHONE();
         ASSERT_EQ(system("rm -rf /data/* /tmp/target && mkdir -p /data/card /tmp/target && "
-                         "ln -s /data/card /data/link_to_card && echo secret > /tmp/target/file"),
-                  0);
+                         "ln -s /data/card /data/link_to_card && echo secret > /tmp/target/file"), 0);
         umask(077);  // modes must not depend on it
     }
 };
@@ -131,7 +130,6 @@ TEST(UpdateFolderRecords, RecordsTheNewFolderLastWithinTheBudget) {
     }
 }
 
-// Copies of a holding folder onto the card (the boot-copy wait is run end to end by the boot scenarios).
 using Files = std::map<std::string, std::string>;
 const std::string kHeld = "/data/log_temp/";
 const std::string N = "TavloLog in Normal\n";
