@@ -1,19 +1,15 @@
 #include "tests/integration/log_daemon.h"
 
-#include <ctype.h>
-#include <dirent.h>
-#include <errno.h>
 #include <stdio.h>
 #include <stdlib.h>
-#include <string.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include <algorithm>
+#include <map>
+#include <sstream>
 
-static const char kNewClient[] = "new client,fd:";
-
-bool contains(const std::string& text, const std::string& needle) {
-    return text.find(needle) != std::string::npos;
-}
+bool contains(const std::string& text, const std::string& needle) { return text.find(needle) != std::string::npos; }
 
 int count(const std::string& text, const std::string& needle) {
     int n = 0;
@@ -21,131 +17,32 @@ int count(const std::string& text, const std::string& needle) {
     return n;
 }
 
-int ctl(EmuPhone& phone, const std::vector<std::string>& args, std::string* out) {
-    std::vector<std::string> command = {"tavlologctl"};
-    command.insert(command.end(), args.begin(), args.end());
-    return phone.exec(command, out);
-}
-
-bool configure(EmuPhone& phone, const std::vector<std::string>& settings) {
-    // One shell for all of them: each exec into the phone costs a fraction of a second.
-    std::string script = "set -e";
-    for (const std::string& s : settings) script += "; tavlologctl '" + s + "'";
-    std::string out;
-    if (phone.exec({"sh", "-c", script}, &out) != 0) return false;
-    std::string expected;
-    for (const std::string& s : settings) expected += s + ",1\n";
-    return out == expected;
-}
-
 std::string history(const EmuPhone& phone) { return phone.read_file(kHistory); }
 
-int daemon_starts(const EmuPhone& phone) {
-    return count(phone.read_file("/dev/emu/init.log"), "start tavlo_log_d pid ");
-}
-
-std::string platform_log(const EmuPhone& phone) { return phone.read_file("/dev/emu/wlog"); }
-
-std::vector<std::string> after_each(const std::string& text, const std::string& needle) {
-    std::vector<std::string> found;
-    for (size_t at = text.find(needle); at != std::string::npos; at = text.find(needle, at + 1)) {
-        size_t from = at + needle.size();
-        size_t end = text.find('\n', from);
-        found.push_back(text.substr(from, end == std::string::npos ? std::string::npos : end - from));
-    }
-    return found;
-}
-
-bool wait_history(const EmuPhone& phone, const std::string& needle, int times, int timeout_ms) {
-    return EmuPhone::wait_for([&] { return count(history(phone), needle) >= times; }, timeout_ms);
-}
-
-std::string history_since_last(const EmuPhone& phone, const std::string& needle) {
-    std::string text = history(phone);
-    size_t at = text.rfind(needle);
-    return at == std::string::npos ? std::string() : text.substr(at + needle.size());
-}
-
-std::vector<std::string> recorded_values(const EmuPhone& phone, const std::string& record,
-                                         bool* same) {
-    // The platform log first: each record goes to the history before it.
-    std::vector<std::string> logged = after_each(platform_log(phone), "TavloLogD: " + record);
-    std::vector<std::string> values = after_each(history(phone), record);
-    *same = !logged.empty() && logged.size() <= values.size() &&
-            std::equal(logged.begin(), logged.end(), values.begin());
-    return values;
-}
-
-bool collector_pids(const EmuPhone& phone, int pids[5]) {
-    std::string text = history(phone);
-    // The record is the only one that starts with "M(" after the time stamp.
-    size_t at = text.rfind(" M(");
-    if (at == std::string::npos) return false;
-    return sscanf(text.c_str() + at, " M(%d),R(%d),E(%d),K(%d),B(%d)", &pids[0], &pids[1],
-                  &pids[2], &pids[3], &pids[4]) == 5;
-}
-
-std::vector<std::string> run_folders(const EmuPhone& phone, const std::string& card) {
-    std::vector<std::string> names;
-    std::string root = phone.host_path(card + "/qrvlog/tavlolog");
-    DIR* dir = root.empty() ? nullptr : opendir(root.c_str());
-    if (dir == nullptr) return names;
-    while (struct dirent* entry = (errno = 0, readdir(dir))) {
-        if (std::string(entry->d_name).compare(0, 6, "APLog_") == 0) names.push_back(entry->d_name);
-    }
-    if (errno != 0) ADD_FAILURE() << "listing " << root << " failed: " << strerror(errno);
-    closedir(dir);
-    std::sort(names.begin(), names.end());
-    return names;
-}
-
-bool is_run_folder_name(const std::string& name) {
-    // APLog_YYYY_MMDD_HHMMSS/
-    static const char kShape[] = "APLog_dddd_dddd_dddddd/";
-    if (name.size() != sizeof(kShape) - 1) return false;
-    for (size_t i = 0; i < name.size(); i++) {
-        if (kShape[i] == 'd' ? !isdigit(static_cast<unsigned char>(name[i])) : name[i] != kShape[i])
-            return false;
-    }
-    int month = atoi(name.substr(11, 2).c_str());
-    int day = atoi(name.substr(13, 2).c_str());
-    int hour = atoi(name.substr(16, 2).c_str());
-    int minute = atoi(name.substr(18, 2).c_str());
-    int second = atoi(name.substr(20, 2).c_str());
-    return month >= 1 && month <= 12 && day >= 1 && day <= 31 && hour < 24 && minute < 60 &&
-           second < 61;
+bool ctl(EmuPhone& phone, const std::string& commands, std::string* out) {
+    // One shell for all of them: each exec into the phone costs a fraction of
+    // a second. A boot that holds its logs serves clients only once through.
+    std::string script = "until grep -q @tavlologd /proc/net/unix; do sleep 0.05; done";
+    std::string expected, word, got;
+    for (std::istringstream in(commands); in >> word;) script += "; tavlologctl " + word, expected += word + ",1\n";
+    phone.exec({"sh", "-c", script}, &got);
+    if (out != nullptr) *out = got;
+    return got == expected;
 }
 
 std::string run_folder(const EmuPhone& phone) { return phone.getprop("debug.TQ.realpath"); }
 
-std::string body_of(const std::string& file, bool* ok) {
-    bool has_header = file.compare(0, sizeof(kFileHeader) - 1, kFileHeader) == 0;
-    if (ok != nullptr) *ok = has_header;
-    return has_header ? file.substr(sizeof(kFileHeader) - 1) : std::string();
-}
-
-std::unique_ptr<EmuProcess> connect_listener(EmuPhone& phone, const std::string& send) {
-    int clients = count(history(phone), kNewClient);
-    std::vector<std::string> args = {"tavlologctl", "--listen"};
-    if (!send.empty()) args.insert(args.end(), {"--send", send});
-    std::unique_ptr<EmuProcess> listener = phone.spawn(args);
-    if (!listener) return nullptr;
-    // With a command, its reply line proves the connection; without one, the
-    // daemon's record of the new client does.
-    bool ready = send.empty() ? wait_history(phone, kNewClient, clients + 1)
-                              : listener->read_until("\n", 10000);
-    return ready ? std::move(listener) : nullptr;
+std::string kill_kernel_collector(const std::string& signal) {
+    // The collectors' pids are recorded as "M(%d),R(%d),E(%d),K(%d),B(%d)".
+    return "kill -" + signal + " $(grep -o 'K([0-9]*)' " + kHistory + " | tail -n 1 | tr -dc 0-9)";
 }
 
 std::string numbered_lines(const std::string& tag, int first, int n, int length) {
     std::string text;
-    text.reserve(static_cast<size_t>(n) * static_cast<size_t>(length));
     char line[256];
-    if (length < 24) length = 24;
-    if (length > static_cast<int>(sizeof(line)) - 1) length = sizeof(line) - 1;
+    length = std::min(std::max(length, 24), static_cast<int>(sizeof(line)) - 1);
     for (int i = first; i < first + n; i++) {
-        int used = snprintf(line, sizeof(line), "%s line %07d ", tag.c_str(), i);
-        if (used > length - 1) used = length - 1;
+        int used = std::min(snprintf(line, sizeof(line), "%s line %07d ", tag.c_str(), i), length - 1);
         for (int j = used; j < length - 1; j++) line[j] = static_cast<char>('a' + (i + j) % 26);
         line[length - 1] = '\n';
         text.append(line, static_cast<size_t>(length));
@@ -153,39 +50,117 @@ std::string numbered_lines(const std::string& tag, int first, int n, int length)
     return text;
 }
 
-// A few bytes around offset, control bytes escaped.
-static std::string excerpt(const std::string& text, size_t offset) {
-    size_t from = offset > 24 ? offset - 24 : 0;
-    std::string shown;
-    for (size_t i = from; i < text.size() && i < offset + 40; i++) {
-        unsigned char c = static_cast<unsigned char>(text[i]);
-        if (c >= 0x20 && c < 0x7f) {
-            shown += static_cast<char>(c);
-        } else {
-            char esc[8];
-            snprintf(esc, sizeof(esc), "\\x%02x", c);
-            shown += esc;
-        }
-    }
-    return "\"" + shown + "\"";
-}
-
 ::testing::AssertionResult same_bytes(const std::string& actual, const std::string& expected) {
-    size_t n = std::min(actual.size(), expected.size());
-    size_t at = 0;
-    while (at < n && actual[at] == expected[at]) at++;
-    if (at == n && actual.size() == expected.size()) return ::testing::AssertionSuccess();
-    return ::testing::AssertionFailure()
-           << actual.size() << " bytes where " << expected.size()
-           << " were expected; first difference at offset " << at << ": got "
-           << excerpt(actual, at) << ", expected " << excerpt(expected, at);
+    size_t at = std::mismatch(actual.begin(), actual.begin() + std::min(actual.size(), expected.size()),
+                              expected.begin()).first - actual.begin();
+    if (actual == expected) return ::testing::AssertionSuccess();
+    return ::testing::AssertionFailure() << actual.size() << " bytes where " << expected.size()
+                                         << " were expected; first difference at offset " << at << ": got \""
+                                         << actual.substr(at, 40) << "\", expected \"" << expected.substr(at, 40)
+                                         << "\"";
 }
 
-bool is_prefix(const std::string& part, const std::string& whole) {
-    return part.size() <= whole.size() && whole.compare(0, part.size(), part) == 0;
+namespace {
+
+const int kWaitMs = 30000;  // only a failing step waits this long
+
+std::string expand(EmuPhone& phone, const std::string& path, const std::string& mark) {
+    if (path.empty() || path[0] != '$') return path;
+    std::string folder = path[1] == 'M' ? mark : run_folder(phone);
+    if (path[1] == 'L')
+        phone.exec({"sh", "-c", "ls -d /mnt/sdcard/qrvlog/tavlolog/*/ | tail -n 1 | tr -d '\\n'"}, &folder);
+    // The kelm boot's card is behind a link that the host cannot follow.
+    if (folder.compare(0, 22, "/data/ext_sdcard_tool/") == 0) folder = "/mnt/sdcard2/" + folder.substr(22);
+    return folder + path.substr(path.find('/') + 1);
 }
 
-bool is_suffix(const std::string& part, const std::string& whole) {
-    return part.size() <= whole.size() &&
-           whole.compare(whole.size() - part.size(), part.size(), part) == 0;
+// Files of the daemon's own folder are seeded as the daemon would have made them.
+bool seed(EmuPhone& phone, const std::string& path, const std::string& content) {
+    bool own = path.compare(0, 17, "/data/misc/tqlog/") == 0;
+    if (!phone.write_image_file(path, content, own ? 0600 : 0644)) return false;
+    std::string file = phone.host_path(path), dir = file.substr(0, file.rfind('/'));
+    return !own || (chown(dir.c_str(), 2000, 1000) == 0 && chmod(dir.c_str(), 0700) == 0 &&
+                    chown(file.c_str(), 2000, 1000) == 0);
+}
+
+}  // namespace
+
+void run_scenario(const Scenario& scenario) {
+    EmuPhone phone;
+    for (const auto& f : scenario.files) ASSERT_TRUE(seed(phone, f.first, f.second)) << f.first;
+    std::vector<std::string> options = scenario.boot;
+    ASSERT_TRUE(phone.boot(options));
+    int starts = 1;
+    std::map<std::string, std::unique_ptr<EmuProcess>> clients;
+    std::string mark;
+    for (const Step& step : scenario.steps) {
+        SCOPED_TRACE(step.op + " " + step.a.substr(0, 60) + " " + step.b.substr(0, 60));
+        const std::string& op = step.op;
+        std::string path = expand(phone, step.a, mark), out;
+        auto file_has = [&] { return contains(phone.read_file(path), step.b); };
+        auto hist_has = [&](int times) { return count(history(phone), step.a) >= times; };
+        int times = step.b.empty() ? 1 : atoi(step.b.c_str());
+        if (op == "boot") {
+            auto mode = std::find(options.begin(), options.end(), "--boot-mode");
+            if (mode == options.end()) mode = options.insert(options.end(), {"--boot-mode", ""});
+            mode[1] = step.a;
+            ASSERT_TRUE(phone.stop() && phone.boot(options));
+            starts++;
+        } else if (op == "crash") {
+            int banners = count(history(phone), "TQLOG START");
+            ASSERT_EQ(0, phone.exec({"kill", "-9", std::to_string(phone.daemon_pid())}));
+            ASSERT_TRUE(EmuPhone::wait_for([&] { return count(history(phone), "TQLOG START") > banners; }));
+            starts++;
+        } else if (op == "ctl") {
+            bool all_done = ctl(phone, step.a, &out);
+            EXPECT_TRUE(step.b.empty() ? all_done : out == step.b) << out;
+        } else if (op == "sh") {
+            phone.exec({"sh", "-c", step.a}, &out);
+            EXPECT_EQ(step.b, out);
+        } else if (op == "kmsg" || op == "btlog") {
+            ASSERT_TRUE(phone.feed(op.c_str(), step.a, 30000));
+        } else if (op == "hist") {
+            EXPECT_TRUE(times == 0 || EmuPhone::wait_for([&] { return hist_has(times); }, kWaitMs)) << history(phone);
+            if (!step.b.empty()) {
+                EXPECT_EQ(times, count(history(phone), step.a)) << history(phone);
+            }
+        } else if (op == "wait") {
+            EXPECT_TRUE(EmuPhone::wait_for([&] { return hist_has(1); }, times * 1000)) << history(phone);
+        } else if (op == "has" || op == "is") {
+            EXPECT_TRUE(EmuPhone::wait_for([&] { return op == "has" ? file_has() : phone.read_file(path) == step.b; }, kWaitMs))
+                << path << ": " << same_bytes(phone.read_file(path), step.b).message();
+        } else if (op == "lacks") {
+            EXPECT_FALSE(file_has()) << path;
+        } else if (op == "gone") {
+            EXPECT_TRUE(EmuPhone::wait_for([&] { return !phone.file_exists(path); }, kWaitMs)) << path;
+        } else if (op == "prop") {
+            EXPECT_TRUE(EmuPhone::wait_for([&] { return phone.getprop(step.a) == step.b; })) << phone.getprop(step.a);
+        } else if (op == "mark") {
+            mark = run_folder(phone);
+        } else if (op == "listen" || op == "spawn") {
+            // A listener is ready once its reply came, or the daemon recorded it.
+            int clients_seen = count(history(phone), "new client,fd:");
+            std::vector<std::string> args = {"tavlologctl", "--listen"};
+            if (!step.b.empty()) args.insert(args.end(), {"--send", step.b});
+            if (op == "spawn") args.clear();
+            for (std::istringstream in(step.b); op == "spawn" && in >> out;) args.push_back(out);
+            auto& client = clients[step.a] = phone.spawn(args);
+            ASSERT_TRUE(client && (op == "spawn" || (step.b.empty() ? EmuPhone::wait_for([&] {
+                                       return count(history(phone), "new client,fd:") > clients_seen;
+                                   }) : client->read_until("\n"))));
+        } else if (op == "hear") {
+            EXPECT_TRUE(clients[step.a]->read_until(step.b)) << clients[step.a]->output();
+        } else if (op == "closed") {
+            EXPECT_EQ(0, clients[step.a]->wait());
+        } else if (op == "end") {
+            clients[step.a]->kill();
+        } else if (op == "alive") {
+            EXPECT_EQ(-1, clients[step.a]->wait(0));
+        } else {
+            FAIL() << "unknown step " << op;
+        }
+        if (::testing::Test::HasFailure()) return;  // later steps build on this one
+    }
+    EXPECT_EQ(starts, count(phone.read_file("/dev/emu/init.log"), "start tavlo_log_d pid "))
+        << "the daemon ended during the test";
 }

@@ -1,10 +1,11 @@
-// Driving the daemon of an emulated phone from an integration test: its
-// commands through tavlologctl inside the phone, its history, its run folders
-// and the kernel-log stream. Every wait polls; nothing sleeps a fixed time.
+// Driving the daemon of an emulated phone: its commands through tavlologctl,
+// its history and run folders, and scenarios written as data run by one driver.
 #pragma once
 
 #include <memory>
+#include <ostream>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -13,74 +14,61 @@
 
 constexpr char kHistory[] = "/data/misc/tqlog/tqlog_history";  // the daemon's central history
 constexpr char kConfig[] = "/data/misc/tqlog/tqlog_config";    // its configuration file
-constexpr char kCardRoot[] = "/mnt/sdcard/qrvlog/tavlolog/";   // run folders on the internal card
 constexpr char kFileHeader[] = "-----timezone: GMT\n";          // first line of every log file
 
 bool contains(const std::string& text, const std::string& needle);
 int count(const std::string& text, const std::string& needle);
-
-// tavlologctl with args inside the phone, as root. Returns its exit status
-// (0 on a ",1" reply, 1 on ",0", 2 when it got no reply); stdout in *out.
-int ctl(EmuPhone& phone, const std::vector<std::string>& args, std::string* out = nullptr);
-
-// Sends each key=value message in turn; true when every one was answered ",1".
-bool configure(EmuPhone& phone, const std::vector<std::string>& settings);
-
 std::string history(const EmuPhone& phone);
-
-// How often the phone's init has started the daemon: more than once means it
-// ended (crashed) and was restarted behind the test's back.
-int daemon_starts(const EmuPhone& phone);
-// The phone's platform log: one "time pid tid priority tag: message" line per record.
-std::string platform_log(const EmuPhone& phone);
-
-// For each line of text that holds needle, what follows it on that line.
-std::vector<std::string> after_each(const std::string& text, const std::string& needle);
-
-// The values the daemon recorded after record ("recv efd_chld ") in its
-// history, in order; *same is set when the platform log shows the same values
-// (it may lag the history by the record being written just now).
-std::vector<std::string> recorded_values(const EmuPhone& phone, const std::string& record,
-                                         bool* same);
-
-// Waits until the central history holds needle at least times times.
-bool wait_history(const EmuPhone& phone, const std::string& needle, int times = 1,
-                  int timeout_ms = 10000);
-
-// The central history after the last occurrence of needle ("" when none).
-std::string history_since_last(const EmuPhone& phone, const std::string& needle);
-
-// The collector pids of the last "M(%d),R(%d),E(%d),K(%d),B(%d)" record, in
-// that order; false when there is none.
-bool collector_pids(const EmuPhone& phone, int pids[5]);
-
-// Names of the run folders ("APLog_...") under <card>/qrvlog/tavlolog/, sorted.
-std::vector<std::string> run_folders(const EmuPhone& phone,
-                                     const std::string& card = "/mnt/sdcard");
-
-// True when name is "APLog_" followed by a time as %Y_%m%d_%H%M%S and a slash.
-bool is_run_folder_name(const std::string& name);
-
+// Runs each space-separated command with tavlologctl once the daemon serves;
+// true when every one was answered ",1".
+bool ctl(EmuPhone& phone, const std::string& commands, std::string* out = nullptr);
 // The property debug.TQ.realpath: the running (or last) run's folder.
 std::string run_folder(const EmuPhone& phone);
-
-// A file's content after its header line; "" with *ok false when the file
-// does not begin with the header.
-std::string body_of(const std::string& file, bool* ok = nullptr);
-
-// `tavlologctl --listen` (with `--send send` when given), once the daemon has
-// taken it into a client slot; nullptr when it did not get there.
-std::unique_ptr<EmuProcess> connect_listener(EmuPhone& phone, const std::string& send = "");
-
-// Lines "<tag> line NNNNNNN ...\n" numbered from first, each of length bytes
+// A shell command that signals the running kernel collector.
+std::string kill_kernel_collector(const std::string& signal);
+// Lines "<tag> line NNNNNNN ...\n" numbered from first, each length bytes
 // (at least 24): a stream in which a lost, doubled or torn line shows.
 std::string numbered_lines(const std::string& tag, int first, int n, int length = 64);
-
-// Byte-exact comparison that reports where the two first differ, with a short
-// excerpt of each, instead of printing megabytes.
+// Byte-exact comparison that says where the two first differ.
 ::testing::AssertionResult same_bytes(const std::string& actual, const std::string& expected);
 
-// True when part is the first part.size() bytes of whole.
-bool is_prefix(const std::string& part, const std::string& whole);
-// True when part is the last part.size() bytes of whole.
-bool is_suffix(const std::string& part, const std::string& whole);
+// One step of a scenario. In paths, $RUN/ is the run folder, $MARK/ the one
+// saved by the last "mark" step, $LAST/ the newest folder on the card.
+//   boot MODE          power off, boot again in that boot mode
+//   crash              kill the daemon, wait until init has started it again
+//   ctl CMDS [REPLY]   tavlologctl, each command answered ",1" or REPLY exactly
+//   sh CMD [OUT]       a shell command as root; its output must be OUT
+//   kmsg|btlog BYTES   feed the kernel log or the Bluetooth log service
+//   hist TEXT [N]      the history holds TEXT (waited for); with N, exactly N times
+//   wait TEXT S        the history holds TEXT within S seconds
+//   has PATH TEXT      the file holds TEXT (waited for); "is": it is exactly TEXT
+//   lacks PATH TEXT    the file does not hold TEXT; "gone PATH": it is gone (waited for)
+//   prop NAME VALUE    the property has VALUE (waited for)
+//   mark               save the run folder as $MARK
+//   listen NAME [CMD]  a `tavlologctl --listen` client, sending CMD when given
+//   spawn NAME ARGS    a process inside the phone, its arguments space-separated
+//   hear NAME TEXT     the client is told TEXT; "closed NAME": it was closed,
+//                      "alive NAME": it is still connected, "end NAME": kill it
+struct Step {
+    Step(std::string o, std::string x = "", std::string y = "") : op(std::move(o)), a(std::move(x)), b(std::move(y)) {}
+    std::string op, a, b;
+};
+
+struct Scenario {
+    const char* name;
+    std::vector<std::pair<std::string, std::string>> files;  // seeded before the boot: path, content
+    std::vector<std::string> boot;                          // tavlo-emu boot options
+    std::vector<Step> steps;
+};
+
+inline void PrintTo(const Scenario& s, std::ostream* os) { *os << s.name; }
+
+// Boots a phone, runs the steps, and checks that the daemon never ended
+// behind the test's back.
+void run_scenario(const Scenario& scenario);
+
+#define SCENARIOS(Suite, ...)                                                               \
+    class Suite : public ::testing::TestWithParam<Scenario> {};                             \
+    TEST_P(Suite, Runs) { run_scenario(GetParam()); }                                      \
+    INSTANTIATE_TEST_SUITE_P(Of, Suite, ::testing::ValuesIn(std::vector<Scenario>(__VA_ARGS__)), \
+                             [](const ::testing::TestParamInfo<Scenario>& i) { return std::string(i.param.name); })

@@ -1,333 +1,217 @@
-// A logging run of the real daemon end to end: what lands in the run folder,
-// rotation into five generations, a stop in the middle of a steady stream,
-// the exception engine's mode around a run, and the two ways a run ends by
-// itself: a full storage card and a removed run folder.
+// Logging runs of the real daemon end to end: every byte of every collector
+// lands once in its file, a stop in a steady stream loses and repeats nothing,
+// rotation, and the ways a run ends by itself.
 #include <errno.h>
 #include <fcntl.h>
 #include <poll.h>
-#include <stdlib.h>
-#include <sys/statfs.h>
-#include <time.h>
+#include <stdio.h>
+#include <string.h>
 #include <unistd.h>
 
 #include <atomic>
-#include <string>
+#include <sstream>
 #include <thread>
-#include <vector>
 
-#include <gtest/gtest.h>
-
-#include "tests/integration/emu_phone.h"
 #include "tests/integration/log_daemon.h"
 
 namespace {
 
-// The kernel collector alone: the other collectors would only add processes.
-const std::vector<std::string> kKernelOnly = {"AndroidLog=0", "BTLog=0"};
+const std::string H = kFileHeader;
 
-long long now_ms() {
-    struct timespec ts;
-    clock_gettime(CLOCK_MONOTONIC, &ts);
-    return static_cast<long long>(ts.tv_sec) * 1000 + ts.tv_nsec / 1000000;
-}
-
-unsigned long long free_bytes(const std::string& host_path) {
-    struct statfs st;
-    if (statfs(host_path.c_str(), &st) != 0) return 0;
-    return static_cast<unsigned long long>(st.f_bavail) * static_cast<unsigned long long>(st.f_bsize);
-}
-
-// Every "recv efd_thread" the daemon recorded is a nonzero multiple of the
-// writer's notice (it may signal again while the run stops), and the platform
-// log shows the same sums as the history.
-void expect_writer_notices(const EmuPhone& phone, int notice) {
-    bool same = false;
-    std::vector<std::string> sums = recorded_values(phone, "recv efd_thread ", &same);
-    EXPECT_TRUE(same) << platform_log(phone);
-    EXPECT_FALSE(sums.empty()) << history(phone);
-    for (const std::string& sum : sums) {
-        EXPECT_NE("0", sum);
-        EXPECT_EQ(0, atoi(sum.c_str()) % notice) << sum;
-    }
-}
-
-TEST(LogRun, KernelLogHoldsTheHeaderAndExactlyTheBytesWritten) {
-    EmuPhone phone;
-    ASSERT_TRUE(phone.boot());
-    std::string out;
-    ASSERT_EQ(0, ctl(phone, {"start"}, &out));
-    std::string folder = run_folder(phone);
-    ASSERT_TRUE(is_run_folder_name(folder.substr(sizeof(kCardRoot) - 1))) << folder;
-
+std::string odd_bytes() {
     // Lines longer than one read of the collector, every byte value, and a
     // last line without its line feed.
-    std::string data = "<6>[    0.000000] first line\n";
-    data += std::string(300, 'L') + "\n";
+    std::string data = "<6>[    0.000000] first line\n" + std::string(300, 'L') + "\n";
     for (int c = 0; c < 256; c++) data += static_cast<char>(c);
-    data += "\n" + std::string(1000, 'M') + "\n<3>no line feed at the end";
-    ASSERT_TRUE(phone.write_kmsg(data));
-    std::string expected = kFileHeader + data;
-    EXPECT_TRUE(EmuPhone::wait_for(
-        [&] { return phone.read_file(folder + "kernel_log").size() >= expected.size(); }));
-    ASSERT_EQ(0, ctl(phone, {"stop"}, &out));
-    EXPECT_TRUE(same_bytes(phone.read_file(folder + "kernel_log"), expected));
-
-    EXPECT_EQ(1, daemon_starts(phone)) << "the daemon ended during the test";
+    return data + "\n" + std::string(1000, 'M') + "\n<3>no line feed at the end";
 }
 
-TEST(LogRun, RotationKeepsFiveGenerationsOfTheNewestBytes) {
-    EmuPhone phone;
-    ASSERT_TRUE(phone.boot());
-    std::vector<std::string> settings = kKernelOnly;
-    settings.push_back("logsize=1");
-    ASSERT_TRUE(configure(phone, settings));
-    std::string out;
-    ASSERT_EQ(0, ctl(phone, {"start"}, &out));
-    ASSERT_EQ("204", phone.getprop("debug.TQ.logsize"));
-    std::string folder = run_folder(phone);
-    std::string current = folder + "kernel_log";
+const std::string kRotation = numbered_lines("rotation", 0, 26000);  // about eight files' worth
 
-    // About eight files' worth: the oldest generations must go.
-    std::string stream = numbered_lines("rotation", 0, 26000, 64);
-    ASSERT_TRUE(phone.write_kmsg(stream, 30000));
-    std::string last_line = stream.substr(stream.size() - 64);
-    EXPECT_TRUE(EmuPhone::wait_for(
-        [&] { return is_suffix(last_line, phone.read_file(current)); }, 20000));
-    ASSERT_EQ(0, ctl(phone, {"stop"}, &out));
+SCENARIOS(Run, {
+    {"KernelLogHoldsTheHeaderAndExactlyTheBytesWritten", {}, {},
+     {{"ctl", "start"}, {"kmsg", odd_bytes()}, {"has", "$RUN/kernel_log", "at the end"}, {"ctl", "stop"},
+      {"is", "$RUN/kernel_log", H + odd_bytes()}}},
+    {"RotationKeepsFiveGenerations", {}, {},
+     {{"ctl", "AndroidLog=0 BTLog=0 logsize=1 start"}, {"prop", "debug.TQ.logsize", "204"}, {"kmsg", kRotation},
+      {"has", "$RUN/kernel_log", kRotation.substr(kRotation.size() - 64)}, {"ctl", "stop"},
+      {"has", "$RUN/kernel_log.4", H}, {"gone", "$RUN/kernel_log.5"}}},
+    // Killed from outside, a collector leaves no reason and no warning is
+    // given; asked to stop by its own signal, it leaves reason 0, which is.
+    {"CollectorDeathStopsTheRunAndTellsEveryClient", {}, {},
+     {{"ctl", "AndroidLog=0 BTLog=0"}, {"listen", "starter", "start"}, {"listen", "bystander"}, {"mark"},
+      {"kmsg", "before the death\n"}, {"has", "$MARK/kernel_log", "before the death"},
+      {"sh", kill_kernel_collector("KILL")}, {"hear", "starter", "tqlog_stopped"},
+      {"hear", "bystander", "tqlog_stopped"}, {"hist", "tavlolog stop done"}, {"prop", "debug.TQ.running", "0"},
+      {"hist", "kLog dies unexpectly", "1"}, {"hist", "all chil processes die", "1"},
+      {"hist", "oru warning comes", "0"}, {"is", "$MARK/kernel_log", H + "before the death\n"},
+      {"alive", "starter"}, {"alive", "bystander"}, {"ctl", "start"}, {"kmsg", "after the death\n"},
+      {"has", "$RUN/kernel_log", "after the death\n"}, {"sh", kill_kernel_collector("USR1")},
+      {"hist", "oru warning comes,type is 0\n"}, {"hist", "all chil processes die", "2"}}},
+    // Five megabytes take the 14 MB card below its 10 MiB reserve.
+    {"LowCardStopsTheRunAndTellsEveryClient", {}, {"--sdcard-size", "14"},
+     {{"ctl", "AndroidLog=0 BTLog=0"}, {"listen", "starter", "start"}, {"listen", "bystander"},
+      {"sh", "dd if=/dev/zero of=/mnt/sdcard/filler bs=1M count=5 2>/dev/null"}, {"kmsg", "after the fill\n"},
+      {"hear", "starter", "storage_full"}, {"hear", "bystander", "storage_full"}, {"hist", "tavlolog stop done"},
+      {"prop", "debug.TQ.running", "0"}, {"hist", "/mnt/sdcard is almost full or unavailable!!"},
+      {"hist", "no space to write log"}, {"alive", "starter"}, {"ctl", "stop"}}},
+    {"RemovedRunFolderStopsTheRunAndTellsEveryClient", {}, {},
+     {{"ctl", "AndroidLog=0 BTLog=0"}, {"listen", "starter", "start"}, {"listen", "bystander"},
+      {"kmsg", "before the removal\n"}, {"has", "$RUN/kernel_log", "before the removal"},
+      {"sh", "rm -r $(getprop debug.TQ.realpath)"}, {"kmsg", "after the removal\n"},
+      {"hear", "starter", "log_folder_lost"}, {"hear", "bystander", "log_folder_lost"},
+      {"hist", "tavlolog stop done"}, {"prop", "debug.TQ.running", "0"}, {"hist", "kernel_log not exist:2"},
+      {"ctl", "start"}, {"has", "$RUN/kernel_log", H}}},
+});
 
-    EXPECT_FALSE(phone.file_exists(current + ".5"));
-    std::string kept;
-    // A file rotates after the write that takes it past 204 KB, by at most one
-    // queue node (65535 bytes).
-    const size_t min_rotated = 205 * 1024;
-    const size_t max_rotated = min_rotated + 65535;
-    for (int generation = 4; generation >= 0; generation--) {
-        std::string name = generation ? current + "." + std::to_string(generation) : current;
-        SCOPED_TRACE(name);
-        std::string file;
-        ASSERT_TRUE(phone.read_file(name, &file));
-        bool has_header = false;
-        std::string body = body_of(file, &has_header);
-        EXPECT_TRUE(has_header);
-        if (generation > 0) {
-            EXPECT_GE(body.size(), min_rotated);
-            EXPECT_LT(body.size(), max_rotated);
-        }
-        kept += body;
-    }
-    // Read in order from the oldest generation on, they are the stream's end.
-    EXPECT_TRUE(is_suffix(kept, stream)) << kept.size() << " bytes kept of " << stream.size();
-    EXPECT_LT(kept.size(), stream.size());
-    EXPECT_EQ(1, daemon_starts(phone)) << "the daemon ended during the test";
-}
-
-// Feeds numbered lines into the phone's kernel log at a steady pace until
-// stopped. Each line is one write, whole in the FIFO or not at all.
+// Feeds numbered lines into the kernel log at a steady pace, about 16 a
+// millisecond (a busy kernel, not a flood). Each line is one write, whole in
+// the FIFO or not at all; while nobody reads, it waits for room.
 class SteadyWriter {
   public:
-    static constexpr int kLineLength = 48;
-
-    explicit SteadyWriter(const std::string& fifo) : fifo_(fifo) {}
-    ~SteadyWriter() { stop(); }
-
-    bool start() {
-        fd_ = open(fifo_.c_str(), O_WRONLY | O_NONBLOCK | O_CLOEXEC);
-        if (fd_ < 0) return false;
-        thread_ = std::thread([this] { feed(); });
-        return true;
-    }
-    void stop() {
+    static constexpr int kLength = 48;
+    explicit SteadyWriter(int fd) : thread_([this, fd] { feed(fd); }) {}
+    ~SteadyWriter() { finish(); }
+    int lines() const { return lines_; }
+    int finish() {  // the lines written, -1 after a failed write
         stop_ = true;
         if (thread_.joinable()) thread_.join();
-        if (fd_ >= 0) close(fd_);
-        fd_ = -1;
+        return failed_ ? -1 : lines_.load();
     }
-    int lines() const { return lines_; }
-    bool failed() const { return failed_; }
 
   private:
-    void feed() {
-        while (!stop_) {
-            // About 16 lines a millisecond: a busy kernel, not a flood.
+    void feed(int fd) {
+        for (; !stop_; usleep(1000)) {
             for (int burst = 0; burst < 16 && !stop_; burst++) {
-                std::string line = numbered_lines("steady", lines_, 1, kLineLength);
-                ssize_t n = write(fd_, line.data(), line.size());
-                if (n == static_cast<ssize_t>(line.size())) {
-                    lines_++;
-                } else if (n < 0 && (errno == EAGAIN || errno == EINTR)) {
-                    // Nobody reads (the run stopped): wait for room, or for the end.
-                    struct pollfd pfd = {fd_, POLLOUT, 0};
-                    poll(&pfd, 1, 10);
-                } else {
-                    failed_ = true;
-                    return;
-                }
+                std::string line = numbered_lines("steady", lines_, 1, kLength);
+                ssize_t n = write(fd, line.data(), line.size());
+                struct pollfd pfd = {fd, POLLOUT, 0};
+                if (n == kLength) lines_++;
+                else if (n < 0 && (errno == EAGAIN || errno == EINTR)) poll(&pfd, 1, 10);
+                else return (void)(failed_ = true);
             }
-            usleep(1000);
         }
     }
-
-    std::string fifo_;
-    int fd_ = -1;
-    std::thread thread_;
-    std::atomic<bool> stop_{false};
+    std::atomic<bool> stop_{false}, failed_{false};
     std::atomic<int> lines_{0};
-    std::atomic<bool> failed_{false};
+    std::thread thread_;
 };
+
+std::string body(const std::string& file) {
+    EXPECT_EQ(0u, file.find(H)) << "no header";
+    return file.compare(0, H.size(), H) == 0 ? file.substr(H.size()) : std::string();
+}
 
 TEST(LogRun, StopInASteadyStreamLosesAndRepeatsNothing) {
     EmuPhone phone;
     ASSERT_TRUE(phone.boot());
-    ASSERT_TRUE(configure(phone, kKernelOnly));
-    std::string out;
-    ASSERT_EQ(0, ctl(phone, {"start"}, &out));
+    ASSERT_TRUE(ctl(phone, "AndroidLog=0 BTLog=0 start"));
     std::string first = run_folder(phone) + "kernel_log";
-
-    SteadyWriter writer(phone.host_path("/dev/emu/kmsg"));
-    ASSERT_TRUE(writer.start());
+    int fd = open(phone.host_path("/dev/emu/kmsg").c_str(), O_WRONLY | O_NONBLOCK | O_CLOEXEC);
+    ASSERT_GE(fd, 0);
+    SteadyWriter writer(fd);
     ASSERT_TRUE(EmuPhone::wait_for([&] { return phone.read_file(first).size() > 20000; }));
+    size_t sent_before_stop = static_cast<size_t>(writer.lines()) * SteadyWriter::kLength;
+    EXPECT_TRUE(ctl(phone, "stop"));
+    int lines = writer.finish();
+    close(fd);
+    ASSERT_GE(lines, 0);
 
-    int sent_before_stop = writer.lines();
-    long long t0 = now_ms();
-    int rc = ctl(phone, {"stop"}, &out);
-    long long stop_ms = now_ms() - t0;
-    writer.stop();
-    ASSERT_FALSE(writer.failed());
-    EXPECT_EQ(0, rc);
-    EXPECT_EQ("stop,1\n", out);
-    // The collector is asked first and killed after 0.9 s at most.
-    EXPECT_LT(stop_ms, 3000);
-
-    const std::string stream = numbered_lines("steady", 0, writer.lines(), SteadyWriter::kLineLength);
-    std::string first_file = phone.read_file(first);
-    std::string first_body = body_of(first_file);
-    EXPECT_TRUE(is_prefix(first_body, stream)) << first_body.size() << " bytes";
     // Whatever was in the kernel log when the stop was sent is in the file.
-    EXPECT_GE(first_body.size(), static_cast<size_t>(sent_before_stop) * SteadyWriter::kLineLength);
+    const std::string stream = numbered_lines("steady", 0, lines, SteadyWriter::kLength);
+    std::string first_file = phone.read_file(first), first_body = body(first_file);
+    EXPECT_EQ(0, stream.compare(0, first_body.size(), first_body));
+    EXPECT_GE(first_body.size(), sent_before_stop);
 
-    // The rest waits in the kernel log; the next run takes it from where the
-    // first one stopped. The collector forwards its reads as they come, and a
-    // FIFO (unlike the kernel's log, which hands out whole records) ends a
-    // read anywhere: the first file may end inside a line that the next run's
-    // file completes. In the same second the next run reuses the folder.
-    ASSERT_EQ(0, ctl(phone, {"start"}, &out));
+    // The rest waits in the kernel log for the next run. A FIFO (unlike the
+    // kernel's log) ends a read anywhere: the first file may end inside a line
+    // that the next one completes. In the same second the next run reuses the folder.
+    ASSERT_TRUE(ctl(phone, "start"));
     std::string second = run_folder(phone) + "kernel_log";
     size_t skip = second == first ? first_file.size() : 0;
-    size_t rest = stream.size() - first_body.size();
     EXPECT_TRUE(EmuPhone::wait_for([&] {
-        return phone.read_file(second).size() >= skip + sizeof(kFileHeader) - 1 + rest;
+        return phone.read_file(second).size() >= skip + H.size() + stream.size() - first_body.size();
     }));
-    ASSERT_EQ(0, ctl(phone, {"stop"}, &out));
-    std::string second_body = body_of(phone.read_file(second).substr(skip));
-    EXPECT_TRUE(same_bytes(first_body + second_body, stream));
-    EXPECT_EQ(1, daemon_starts(phone)) << "the daemon ended during the test";
+    ASSERT_TRUE(ctl(phone, "stop"));
+    EXPECT_TRUE(same_bytes(first_body + body(phone.read_file(second).substr(skip)), stream));
+    EXPECT_EQ(1, count(phone.read_file("/dev/emu/init.log"), "start tavlo_log_d pid "));
 }
 
-struct OruCase {
-    const char* name;
-    std::vector<std::string> build_prop;
-    const char* after_start;  // content of the oru stand-in's call record
-    const char* after_stop;
-};
-
-void PrintTo(const OruCase& c, std::ostream* os) { *os << c.name; }
-
-class LogRunOru : public ::testing::TestWithParam<OruCase> {};
-
-TEST_P(LogRunOru, ModeFollowsTheBuild) {
-    const OruCase& c = GetParam();
-    EmuPhone phone;
-    BootOptions options;
-    options.build_prop = c.build_prop;
-    ASSERT_TRUE(phone.boot(options));
-    EXPECT_EQ("", phone.read_file("/dev/emu/oru_calls"));
-    std::string out;
-    ASSERT_EQ(0, ctl(phone, {"start"}, &out));
-    EXPECT_EQ(c.after_start, phone.read_file("/dev/emu/oru_calls"));
-    ASSERT_EQ(0, ctl(phone, {"stop"}, &out));
-    EXPECT_EQ(c.after_stop, phone.read_file("/dev/emu/oru_calls"));
-    bool switched = c.after_start[0] != '\0';
-    EXPECT_EQ(switched, contains(history(phone), "init oru mode:"));
-    EXPECT_EQ(switched, contains(history(phone), "deinit oru mode:"));
-    EXPECT_EQ(1, daemon_starts(phone)) << "the daemon ended during the test";
+// "MM-DD HH:MM:SS.mmm  pid  tid P tag: message", as the platform library renders it.
+bool is_threadtime(const std::string& line) {
+    int f[8], used = 0;
+    char priority;
+    return sscanf(line.c_str(), "%2d-%2d %2d:%2d:%2d.%3d %d %d %c %n", &f[0], &f[1], &f[2], &f[3], &f[4], &f[5],
+                  &f[6], &f[7], &priority, &used) == 9 &&
+           used > 0 && strchr("VDIWEF", priority) != nullptr && line.find(": ", used) != std::string::npos;
 }
 
-INSTANTIATE_TEST_SUITE_P(
-    Builds, LogRunOru,
-    ::testing::Values(OruCase{"UserCustomer", {}, "-m 3\n", "-m 3\n-m 4\n"},
-                      OruCase{"UserInternal", {"ro.oru.build.info=internal"}, "-m 1\n",
-                              "-m 1\n-m 2\n"},
-                      OruCase{"Eng", {"ro.build.type=eng"}, "", ""}),
-    [](const ::testing::TestParamInfo<OruCase>& info) { return info.param.name; });
-
-TEST(LogRunEnds, WhenTheCardRunsLowEveryClientHearsStorageFull) {
-    EmuPhone phone;
-    BootOptions options;
-    options.sdcard_mb = 14;
-    ASSERT_TRUE(phone.boot(options));
-    ASSERT_GT(free_bytes(phone.host_path("/mnt/sdcard")), 10ull << 20);
-    ASSERT_TRUE(configure(phone, kKernelOnly));
-    auto starter = connect_listener(phone, "start");
-    ASSERT_TRUE(starter);
-    EXPECT_EQ("start,1\n", starter->output());
-    auto bystander = connect_listener(phone);
-    ASSERT_TRUE(bystander);
-    std::string folder = run_folder(phone);
-
-    // Six megabytes take the card below 10 MiB free. Once the run stops nobody
-    // reads any more, so the writing ends there.
-    const std::string stream = numbered_lines("fill", 0, 6 * 16384, 64);
-    for (size_t at = 0; at < stream.size() && phone.getprop("debug.TQ.running") == "1";
-         at += 256 * 1024) {
-        if (!phone.write_kmsg(stream.substr(at, 256 * 1024), 3000)) break;
-    }
-    EXPECT_TRUE(starter->read_until("storage_full", 10000)) << starter->output();
-    EXPECT_TRUE(bystander->read_until("storage_full", 10000)) << bystander->output();
-    EXPECT_TRUE(wait_history(phone, "tavlolog stop done"));
-    EXPECT_EQ("0", phone.getprop("debug.TQ.running"));
-    std::string text = history(phone);
-    EXPECT_TRUE(contains(text, "/mnt/sdcard is almost full or unavailable!!")) << text;
-    EXPECT_TRUE(contains(text, "no space to write log")) << text;
-    expect_writer_notices(phone, 1001);
-    EXPECT_TRUE(is_prefix(body_of(phone.read_file(folder + "kernel_log")), stream));
-    // The daemon still serves its clients.
-    EXPECT_EQ(-1, starter->wait(0));
-    std::string out;
-    EXPECT_EQ(0, ctl(phone, {"stop"}, &out));
-    EXPECT_EQ("stop,1\n", out);
-    EXPECT_EQ(1, daemon_starts(phone)) << "the daemon ended during the test";
+std::string numbered(const std::string& word, int n) {
+    std::string text;
+    for (int i = 0; i < n; i++) text += word + " " + std::to_string(i) + "\n";
+    return text;
 }
 
-TEST(LogRunEnds, WhenTheRunFolderIsRemovedEveryClientHearsFolderLost) {
+TEST(AllCollectors, EveryEntryLandsOnceInItsFileAndTheStopTakesThemAll) {
     EmuPhone phone;
     ASSERT_TRUE(phone.boot());
-    ASSERT_TRUE(configure(phone, kKernelOnly));
-    auto starter = connect_listener(phone, "start");
-    ASSERT_TRUE(starter);
-    auto bystander = connect_listener(phone);
-    ASSERT_TRUE(bystander);
-    std::string folder = run_folder(phone);
-    ASSERT_TRUE(phone.write_kmsg("before the removal\n"));
-    ASSERT_TRUE(EmuPhone::wait_for(
-        [&] { return contains(phone.read_file(folder + "kernel_log"), "before the removal"); }));
+    ASSERT_TRUE(ctl(phone, "start"));
+    std::string folder = run_folder(phone), text = history(phone);
+    int pids[5] = {};
+    size_t at = text.rfind(" M(");
+    ASSERT_NE(std::string::npos, at);
+    sscanf(text.c_str() + at, " M(%d),R(%d),E(%d),K(%d),B(%d)", &pids[0], &pids[1], &pids[2], &pids[3], &pids[4]);
+    for (int pid : pids) EXPECT_GT(pid, 0) << text.substr(at, 60);
 
-    ASSERT_EQ(0, phone.exec({"rm", "-r", folder}));
-    ASSERT_TRUE(phone.write_kmsg("after the removal\n"));
-    EXPECT_TRUE(starter->read_until("log_folder_lost", 10000)) << starter->output();
-    EXPECT_TRUE(bystander->read_until("log_folder_lost", 10000)) << bystander->output();
-    EXPECT_TRUE(wait_history(phone, "tavlolog stop done"));
-    EXPECT_EQ("0", phone.getprop("debug.TQ.running"));
-    std::string text = history(phone);
-    EXPECT_TRUE(contains(text, "log files " + folder + "kernel_log not exist:2")) << text;
-    expect_writer_notices(phone, 1002);
-    EXPECT_FALSE(phone.file_exists(folder));
+    // Kernel and Bluetooth bytes pass through relays of the phone: wait for them.
+    std::string bt;
+    for (int i = 0; i < 600; i++) bt.push_back(static_cast<char>(i % 256));
+    ASSERT_TRUE(phone.feed("btlog", bt) && phone.feed("kmsg", "<6>kernel line\n"));
+    EXPECT_TRUE(EmuPhone::wait_for([&] {
+        return phone.read_file(folder + "bt_log").size() > bt.size() &&
+               contains(phone.read_file(folder + "kernel_log"), "kernel line");
+    }));
+    // The Android entries are written right before the stop.
+    const struct {
+        std::vector<std::string> args;
+        std::string input;
+    } writes[] = {
+        {{"log", "-t", "demo", "hello"}, ""},
+        {{"log", "-b", "system", "-t", "sys"}, numbered("system", 300)},
+        {{"log", "-t", "num"}, numbered("main", 300)},
+        {{"log", "-b", "radio", "-t", "rad"}, numbered("radio", 100)},
+        {{"log", "-b", "events", "-t", "1000001", "i:42"}, ""},
+        {{"log", "-b", "events", "-t", "1000003", "i:3", "s:lbl"}, ""},
+    };
+    for (const auto& w : writes) ASSERT_EQ(0, phone.exec(w.args, nullptr, w.input)) << w.args[1];
+    ASSERT_TRUE(ctl(phone, "stop"));
 
-    // The next start makes its folder again.
-    std::string out;
-    EXPECT_EQ(0, ctl(phone, {"start"}, &out));
-    EXPECT_EQ("start,1\n", out);
-    EXPECT_TRUE(phone.file_exists(run_folder(phone) + "kernel_log"));
-    EXPECT_EQ(1, daemon_starts(phone)) << "the daemon ended during the test";
+    std::string main_log = body(phone.read_file(folder + "main_log")), previous;
+    EXPECT_EQ(0u, main_log.find("--------- beginning of /dev/log/main\n"));
+    EXPECT_EQ(1, count(main_log, "--------- beginning of /dev/log/system\n"));
+    std::istringstream in(main_log);
+    for (std::string line; std::getline(in, line);) {
+        if (line.rfind("--------- beginning of ", 0) == 0) continue;
+        EXPECT_TRUE(is_threadtime(line)) << line;
+        EXPECT_LE(previous, line.substr(0, 18)) << "out of time order: " << line;
+        previous = line.substr(0, 18);
+    }
+    EXPECT_EQ(1, count(main_log, " I demo    : hello\n"));
+    std::string radio_log = body(phone.read_file(folder + "radio_log"));
+    const struct {
+        const std::string* log;
+        const char* word;
+        int n;
+    } streams[] = {{&main_log, "main", 300}, {&main_log, "system", 300}, {&radio_log, "radio", 100}};
+    for (const auto& s : streams)
+        for (int i = 0; i < s.n; i++) EXPECT_EQ(1, count(*s.log, std::string(": ") + s.word + " " + std::to_string(i) + "\n")) << s.word << i;
+    std::string events_log = body(phone.read_file(folder + "events_log"));
+    EXPECT_EQ(1, count(events_log, " I tavlo_demo_int: 42\n")) << events_log;
+    EXPECT_EQ(1, count(events_log, " I tavlo_demo_list: [3,lbl]\n")) << events_log;
+    EXPECT_TRUE(same_bytes(body(phone.read_file(folder + "bt_log")), bt));
+    EXPECT_EQ("<6>kernel line\n", body(phone.read_file(folder + "kernel_log")));
+    EXPECT_FALSE(contains(history(phone), "dies unexpectly")) << history(phone);
+    EXPECT_EQ(1, count(phone.read_file("/dev/emu/init.log"), "start tavlo_log_d pid "));
 }
 
 }  // namespace
