@@ -170,7 +170,7 @@ TEST_F(HistoryLogTest, ForkedChildRecordsWhileAThreadHoldsTheLock) {
 TEST_F(HistoryLogTest, ConcurrentWritersNeverInterleave) {
     ASSERT_EQ(property_set("debug.TQ.realpath", kRunFolder), 0);
     auto writer = [](char c) {
-        for (int i = 0; i < 200; i++) {
+        for (int i = 0; i < 1000; i++) {
             history_log(2, "%s", std::string(200, c).c_str());
             WLOG(TAG_DEBUG, WLOG_DEBUG, "%s", std::string(700, c).c_str());
         }
@@ -186,11 +186,11 @@ TEST_F(HistoryLogTest, ConcurrentWritersNeverInterleave) {
     ASSERT_TRUE(exits_with(child, 0, 30000));
     for (const std::string& path : {std::string(kHistory), kRunFile}) {
         Lines messages = messages_of(path);
-        EXPECT_EQ(messages.size(), 600u) << path;
+        EXPECT_EQ(messages.size(), 3000u) << path;
         for (const std::string& m : messages) ASSERT_EQ(m, std::string(200, m[0])) << path << ": a torn record";
     }
     Lines wlog = lines_of(kLog);
-    EXPECT_EQ(wlog.size(), 600u);
+    EXPECT_EQ(wlog.size(), 3000u);
     for (const std::string& line : wlog) ASSERT_EQ(line.substr(line.find(": ") + 2), std::string(700, line.back())) << "torn";
 }
 
