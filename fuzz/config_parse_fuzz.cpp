@@ -1,21 +1,8 @@
-// Randomized harness for the configuration parser: random and mutated lines
-// (binary bytes, huge lengths, many '=', spaces, line feeds) thrown at trim,
-// config_parse_line and config_read_file, each result checked against a small
-// model of the line syntax and against the cache's invariants.
-//
-//   config_parse_fuzz [SECONDS [SEED]]   (or TAVLO_FUZZ_SECONDS, TAVLO_FUZZ_SEED)
-//
-// Runs inside the emulated phone only: it writes /data and /system/etc.
-#include <fcntl.h>
-#include <stdio.h>
-#include <stdlib.h>
+// Random configuration lines and files through trim, config_parse_line and
+// config_read_file, checked against a small model of the syntax.
 #include <string.h>
-#include <sys/stat.h>
-#include <time.h>
-#include <unistd.h>
 
-#include <random>
-#include <string>
+#include <fstream>
 #include <vector>
 
 #include "config/config_store.h"
@@ -23,253 +10,101 @@
 
 namespace {
 
-constexpr unsigned long DEFAULT_SEED = 0x7a7101;
-constexpr double DEFAULT_SECONDS = 10.0;
+// The daemon's keys, then the system image's.
+const char* const KEYS[] = {"autostart", "logpath", "logsize", "AndroidLog", "KernelLog", "BTLog", "totallogsize",
+                            "com.quorvex.log.tavlo.enabled", "com.quorvex.log.tavlo.maxsize", "qrvlog_path"};
+const char kSoup[] = "  ==\n\n\r\tabc01_.";
 
-const char* const KEYS[CONFIG_ITEM_COUNT] = {"autostart", "logpath",  "logsize", "AndroidLog",
-                                             "KernelLog", "BTLog", "totallogsize"};
-const char* const SYSTEM_KEYS[] = {"com.quorvex.log.tavlo.enabled", "com.quorvex.log.tavlo.maxsize",
-                                   "qrvlog_path"};
+ConfigCache cache;
+std::string values[CONFIG_ITEM_COUNT];  // the model's cache
 
-std::mt19937_64 rng;
-unsigned long iteration = 0;
-unsigned long seed = DEFAULT_SEED;
+std::string spaces(Fuzz& f) { return std::string(f.pick(4) ? f.pick(3) : f.pick(300), ' '); }
 
-size_t pick(size_t n) { return n == 0 ? 0 : static_cast<size_t>(rng() % n); }
-
-[[noreturn]] void fail(const char* what, const std::string& input) {
-    fprintf(stderr, "config_parse_fuzz: FAILED at iteration %lu (seed %lu): %s\ninput (%zu bytes): \"%s\"\n",
-            iteration, seed, what, input.size(), fuzz_printable(input.substr(0, 4096)).c_str());
-    abort();
-}
-
-// --- input generation ------------------------------------------------------
-
-std::string random_bytes(size_t max_len) {
-    std::string s(pick(max_len + 1), '\0');
-    for (char& c : s) c = static_cast<char>(rng() & 0xff);
+std::string line(Fuzz& f) {
+    std::string key = f.pick(4) ? KEYS[f.pick(10)] : f.text(20, kSoup, 16);
+    std::string value;
+    switch (f.pick(5)) {
+        case 0: value = f.pick(2) ? std::to_string(f.rng() % 100000) : f.pick(2) ? "true" : "TRUE"; break;
+        case 1: value = std::string(CONFIG_FIELD_LEN - 2 + f.pick(4), 'v'); break;  // around the limit
+        case 2: value = f.text(f.pick(2) ? 30 : 1500, kSoup, 16); break;
+        default: value = f.text(f.pick(2) ? 40 : 2000); break;
+    }
+    std::string s = spaces(f) + key + spaces(f) + std::string(f.pick(8) ? 1 : f.pick(5), '=') + spaces(f) + value + spaces(f);
+    if (f.pick(4)) s += '\n';
+    if (f.pick(4) == 0) s.insert(f.pick(s.size() + 1), f.pick(2) ? f.text(8) : std::string(f.pick(1200), "= \nx"[f.pick(4)]));
     return s;
 }
 
-// Text made mostly of the characters the parser cares about.
-std::string syntax_soup(size_t max_len) {
-    static const char alphabet[] = "  ==\n\n\r\tabc01_.";
-    std::string s(pick(max_len + 1), ' ');
-    for (char& c : s) c = alphabet[pick(sizeof(alphabet) - 1)];
-    return s;
-}
-
-std::string spaces() { return std::string(pick(4) == 0 ? pick(300) : pick(3), ' '); }
-
-std::string some_key() {
-    switch (pick(5)) {
-        case 0:
-        case 1: return KEYS[pick(CONFIG_ITEM_COUNT)];
-        case 2: return SYSTEM_KEYS[pick(3)];
-        case 3: return syntax_soup(20);
-        default: return random_bytes(pick(2) ? 16 : 400);
-    }
-}
-
-std::string some_value() {
-    switch (pick(6)) {
-        case 0: return std::to_string(rng() % 100000);
-        case 1: return pick(2) ? "true" : "TRUE";
-        case 2: return std::string(CONFIG_FIELD_LEN - 2 + pick(4), 'v');  // around the 91-character limit
-        case 3: return syntax_soup(pick(2) ? 30 : 1500);
-        case 4: return random_bytes(pick(2) ? 40 : 2000);
-        default: return "";
-    }
-}
-
-std::string structured_line() {
-    std::string line = spaces() + some_key() + spaces();
-    int equals = pick(8) == 0 ? static_cast<int>(pick(5)) : 1;
-    for (int i = 0; i < equals; i++) line += '=';
-    line += spaces() + some_value() + spaces();
-    if (pick(4) != 0) line += '\n';
-    return line;
-}
-
-std::string mutate(std::string s) {
-    int edits = 1 + static_cast<int>(pick(4));
-    for (int i = 0; i < edits; i++) {
-        size_t at = pick(s.size() + 1);
-        switch (pick(6)) {
-            case 0: if (!s.empty()) s[pick(s.size())] = static_cast<char>(rng() & 0xff); break;
-            case 1: s.insert(at, 1, "= \n"[pick(3)]); break;
-            case 2: s.insert(at, std::string(pick(1200), "= \nx"[pick(4)])); break;
-            case 3: s.erase(at, pick(40)); break;
-            case 4: s += s.substr(0, pick(s.size() + 1)); break;
-            default: s.insert(at, random_bytes(8)); break;
-        }
-    }
-    return s;
-}
-
-std::string random_line(const std::string& previous) {
-    switch (pick(4)) {
-        case 0: return random_bytes(pick(4) ? 300 : 3000);
-        case 1: return mutate(previous);
-        default: return structured_line();
-    }
-}
-
-// --- the model -------------------------------------------------------------
-
-std::string model_trim(const std::string& s) {
-    size_t len = s.size();
-    while (len > 1 && (s[len - 1] == ' ' || s[len - 1] == '\n')) len--;
-    size_t start = 0;
-    while (start < len && s[start] == ' ') start++;
-    return s.substr(start, len - start);
-}
-
-struct Model {
-    std::string values[CONFIG_ITEM_COUNT];
-};
-
-void model_update(Model* m, const std::string& key, const std::string& value) {
-    for (int i = 0; i < CONFIG_ITEM_COUNT; i++) {
-        if (key == KEYS[i]) {
-            if (value.size() < static_cast<size_t>(CONFIG_FIELD_LEN)) m->values[i] = value;
-            return;
-        }
-    }
-}
-
-void model_parse(Model* m, int source, const char* line) {
-    std::string s(line, strnlen(line, 254));
+// A line of the daemon's file (source 0) or of the system defaults (1).
+void model_parse(int source, const std::string& line) {
+    std::string s = line.substr(0, std::min(line.find('\0'), size_t{254}));
     size_t eq = s.find('=');
     if (eq == std::string::npos || eq == 0 || eq + 1 == s.size()) return;
-    std::string key = model_trim(s.substr(0, eq));
-    std::string value = model_trim(s.substr(eq + 1));
-    if (source == 0) {
-        model_update(m, key, value);
-    } else if (source == 1) {
-        if (key == SYSTEM_KEYS[0]) model_update(m, "autostart", value == "true" ? "1" : "0");
-        if (key == SYSTEM_KEYS[1]) model_update(m, "logsize", value);
-        if (key == SYSTEM_KEYS[2]) model_update(m, "logpath", value);
+    std::string key = fuzz_skip_spaces(fuzz_trimmed(s.substr(0, eq)));
+    std::string value = fuzz_skip_spaces(fuzz_trimmed(s.substr(eq + 1)));
+    if (source == 1) {
+        if (key == KEYS[7]) value = value == "true" ? "1" : "0";
+        key = key == KEYS[7] ? KEYS[0] : key == KEYS[8] ? KEYS[2] : key == KEYS[9] ? KEYS[1] : "";
     }
+    for (int i = 0; i < CONFIG_ITEM_COUNT; i++)
+        if (key == KEYS[i] && value.size() < CONFIG_FIELD_LEN) values[i] = value;
 }
 
-// A file as config_read_file sees it: pieces of at most 1022 characters,
-// pieces holding a NUL byte skipped.
-void model_read(Model* m, int source, const std::string& content) {
-    size_t pos = 0;
-    while (pos < content.size()) {
+// A file is read in pieces of at most 1022 characters; a piece holding a NUL byte is skipped.
+void model_read(int source, const std::string& content) {
+    for (size_t pos = 0, len; pos < content.size(); pos += len) {
         size_t end = content.find('\n', pos);
-        size_t len = end == std::string::npos ? content.size() - pos : end - pos + 1;
-        if (len > 1022) len = 1022;
-        std::string piece = content.substr(pos, len);
-        pos += len;
-        if (piece.find('\0') != std::string::npos) continue;
-        model_parse(m, source, piece.c_str());
+        len = std::min(end == std::string::npos ? content.size() - pos : end - pos + 1, size_t{1022});
+        if (content.substr(pos, len).find('\0') == std::string::npos) model_parse(source, content.substr(pos, len));
     }
 }
 
-Model model_of(const ConfigCache& cache) {
-    Model m;
-    for (int i = 0; i < CONFIG_ITEM_COUNT; i++) m.values[i] = cache.items[i].value;
-    return m;
+void reset() {
+    config_set_defaults(&cache);
+    for (int i = 0; i < CONFIG_ITEM_COUNT; i++) values[i] = cache.items[i].value;
 }
 
-// --- invariants --------------------------------------------------------------
-
-void check_cache(const ConfigCache& cache, const Model& expected, const std::string& input) {
+const char* check_cache() {
     for (int i = 0; i < CONFIG_ITEM_COUNT; i++) {
-        const ConfigItem& item = cache.items[i];
-        if (strnlen(item.key, CONFIG_FIELD_LEN) >= static_cast<size_t>(CONFIG_FIELD_LEN)) fail("key not terminated", input);
-        if (strnlen(item.value, CONFIG_FIELD_LEN) >= static_cast<size_t>(CONFIG_FIELD_LEN)) fail("value not terminated", input);
-        if (strcmp(item.key, KEYS[i]) != 0) fail("a key changed", input);
-        if (expected.values[i] != item.value) {
-            fprintf(stderr, "item %s: got \"%s\", model \"%s\"\n", KEYS[i], fuzz_printable(item.value).c_str(),
-                    fuzz_printable(expected.values[i]).c_str());
-            fail("value differs from the model", input);
-        }
+        if (strnlen(cache.items[i].value, CONFIG_FIELD_LEN) == CONFIG_FIELD_LEN) return "value not terminated";
+        if (strcmp(cache.items[i].key, KEYS[i]) != 0) return "a key changed";
+        if (values[i] != cache.items[i].value) return "value differs from the model";
     }
+    return nullptr;
 }
 
-void check_trim(const std::string& input) {
-    std::vector<char> buf(input.begin(), input.end());
-    buf.push_back('\0');
-    std::string as_c(buf.data());
-    // Guard bytes after the terminator catch a write past the string.
-    buf.insert(buf.end(), 8, '#');
-    char* r = trim(buf.data());
-    if (r < buf.data() || r > buf.data() + as_c.size()) fail("trim result outside the string", input);
-    if (r[strnlen(r, as_c.size() + 1)] != '\0') fail("trim result not terminated", input);
-    // Everything after the C string (the rest of a line holding a NUL, the
-    // guard) must stay as it was.
-    for (size_t i = as_c.size() + 1; i < buf.size(); i++) {
-        char expected = i < input.size() ? input[i] : (i == input.size() ? '\0' : '#');
-        if (buf[i] != expected) fail("trim wrote past the string", input);
-    }
-    if (std::string(r) != model_trim(as_c)) fail("trim differs from the model", input);
-}
+const char* one_round(Fuzz& f) {
+    if (f.round == 0) config_init(&cache), reset();
+    f.input = line(f);
+    // Guard bytes behind the string catch a write past it.
+    std::string c_string = f.input.substr(0, f.input.find('\0'));
+    std::vector<char> buf(c_string.begin(), c_string.end());
+    buf.insert(buf.end(), {'\0', '#', '#', '#', '#'});
+    char* trimmed = trim(buf.data());
+    if (trimmed < buf.data() || trimmed > buf.data() + c_string.size() ||
+        trimmed != fuzz_skip_spaces(fuzz_trimmed(c_string)))
+        return "trim differs from the model";
+    if (std::string(buf.end() - 4, buf.end()) != "####") return "trim wrote past the string";
 
-void write_file(const char* path, const std::string& content) {
-    int fd = open(path, O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
-    if (fd < 0) {
-        perror(path);
-        exit(2);
-    }
-    if (write(fd, content.data(), content.size()) != static_cast<ssize_t>(content.size())) {
-        perror(path);
-        exit(2);
-    }
-    close(fd);
+    if (f.pick(16) == 0) reset();
+    cache.source = static_cast<int>(f.pick(2));
+    model_parse(cache.source, f.input);
+    config_parse_line(&cache, f.input.c_str());
+    if (const char* failed = check_cache()) return failed;
+
+    if (f.round % 64 != 0) return nullptr;
+    // A whole file of such lines, as either file.
+    f.input.clear();
+    for (size_t n = f.pick(40); n > 0; n--) f.input += line(f);
+    int source = static_cast<int>(f.pick(2));
+    const char* path = source == 0 ? CONFIG_FILE : SYSTEM_DEFAULTS_FILE;
+    if (!(std::ofstream(path, std::ios::binary) << f.input)) return "cannot write the file";
+    reset();
+    model_read(source, f.input);
+    if (config_read_file(&cache, path) != 1 || cache.source != source) return "file not read as its kind";
+    return check_cache();
 }
 
 }  // namespace
 
-int main(int argc, char** argv) {
-    double seconds = DEFAULT_SECONDS;
-    fuzz_start("config_parse_fuzz", argc, argv, &seconds, &seed);
-    rng.seed(seed);
-
-    ConfigCache cache;
-    config_init(&cache);
-    std::string previous = "logsize=300\n";
-    double deadline = fuzz_now() + seconds;
-    unsigned long files = 0;
-    for (iteration = 0; fuzz_now() < deadline; iteration++) {
-        std::string line = random_line(previous);
-        // Mutations of mutations grow; start over from a fresh line now and then.
-        previous = line.size() > 8192 ? structured_line() : line;
-
-        check_trim(line);
-
-        // One line into a cache, for either source.
-        if (pick(16) == 0) config_set_defaults(&cache);
-        cache.source = static_cast<int>(pick(2));
-        Model expected = model_of(cache);
-        model_parse(&expected, cache.source, line.c_str());
-        config_parse_line(&cache, line.c_str());
-        check_cache(cache, expected, line);
-
-        // Now and then a whole file of such lines, as either file.
-        if (iteration % 64 == 0) {
-            std::string content;
-            size_t lines = pick(40);
-            std::string prev = previous;
-            for (size_t i = 0; i < lines; i++) {
-                prev = random_line(prev.size() > 8192 ? structured_line() : prev);
-                content += prev;
-            }
-            if (content.size() > (2 << 20)) content.resize(2 << 20);
-            bool own = pick(2) == 0;
-            const char* path = own ? CONFIG_FILE : SYSTEM_DEFAULTS_FILE;
-            write_file(path, content);
-            config_set_defaults(&cache);
-            Model file_model = model_of(cache);
-            model_read(&file_model, own ? 0 : 1, content);
-            if (config_read_file(&cache, path) != 1) fail("file could not be read", content);
-            if (cache.source != (own ? 0 : 1)) fail("source not set from the path", content);
-            check_cache(cache, file_model, content);
-            files++;
-        }
-    }
-    printf("config_parse_fuzz: %lu lines, %lu files, no failure\n", iteration, files);
-    return 0;
-}
+int main(int argc, char** argv) { return fuzz_main("config_parse_fuzz", argc, argv, 0x7a7101, 30000, one_round); }

@@ -1,14 +1,8 @@
-// Randomized harness for the parsers of the dump list and of the folder
-// records: random and syntax-heavy bytes (long lines, NUL bytes, runs of
-// spaces, names that climb) through parse_dump_list_text and
-// parse_folder_records, each result checked against a small model; parsed
-// records are also written and read back unchanged.
-//
-//   storage_parse_fuzz [SECONDS [SEED]]   (or TAVLO_FUZZ_SECONDS, TAVLO_FUZZ_SEED)
+// Syntax-heavy bytes through the dump list and folder record parsers, checked
+// against small models; parsed records are also written and read back.
 #include <limits.h>
 #include <sys/stat.h>
 
-#include <random>
 #include <string>
 #include <vector>
 
@@ -17,21 +11,6 @@
 #include "storage/folder_records.h"
 
 namespace {
-
-std::mt19937_64 rng;
-size_t pick(size_t n) { return n == 0 ? 0 : static_cast<size_t>(rng() % n); }
-
-std::string random_text() {
-    static const std::string pieces[] = {" ", "  ", "\n", "#", "/src", "out", "sys_prop", "..", "/", ".",
-                                         std::string(1, '\0'), "APLog_2026_0304_070649", "-7", "99999999999"};
-    std::string s;
-    for (size_t n = pick(80); n > 0; n--) {
-        size_t k = pick(8);
-        s += k == 0 ? std::string(pick(300), "sx /1"[pick(5)])
-                    : k == 1 ? std::string(1, static_cast<char>(rng())) : pieces[pick(sizeof(pieces) / sizeof(pieces[0]))];
-    }
-    return s;
-}
 
 // The lines of text (with their line feed when keep_feed), empty when longer
 // than 254 bytes, each read up to a NUL.
@@ -48,7 +27,8 @@ std::vector<std::string> lines(const std::string& text, bool keep_feed) {
 
 bool plain_name(const std::string& n) { return !n.empty() && n.find('/') == std::string::npos && n != "." && n != ".."; }
 
-// Not comments, split at spaces, output names that are one file name and fit; last line first.
+// Not comments, split at spaces, output names that are one file name and fit, kinds as written;
+// last line first.
 std::vector<std::string> dump_model(const std::string& text, const std::string& run) {
     std::vector<std::string> out;
     for (const std::string& line : lines(text, false)) {
@@ -84,42 +64,37 @@ std::vector<std::string> records_of(FolderRecord* list) {
     return out;
 }
 
+const char* one_round(Fuzz& f) {
+    static const std::string pieces[] = {" ", "  ", "\n", "#", "/src", "out", "sys_prop", "SYS_PROP", "..", "/", ".",
+                                         std::string(1, '\0'), "APLog_2026_0304_070649", "-7", "99999999999"};
+    if (f.round == 0) mkdir("/data/misc", 0771);
+    for (size_t n = f.pick(80); n > 0; n--) {
+        size_t k = f.pick(8);
+        f.input += k == 0 ? std::string(f.pick(300), "sx /1"[f.pick(5)]) : k == 1 ? f.bytes(1) : pieces[f.pick(15)];
+    }
+    const std::string& text = f.input;
+    std::string run = "/mnt/sdcard/" + std::string(f.pick(250), 'r') + "/";
+    std::vector<std::string> entries;
+    DumpEntry* list = parse_dump_list_text(text.data(), text.size(), "/mnt/sdcard", run.c_str());
+    for (DumpEntry* e = list; e != nullptr; e = e->next)
+        entries.push_back(std::string(e->source) + ">" + e->output + (e->dumper == dump_properties ? "P" : "F"));
+    free_dump_list(list);
+    if (entries != dump_model(text, run)) return "dump list differs from the model";
+
+    FolderRecord* records = parse_folder_records(text.data(), text.size());
+    bool written = f.round % 16 == 0 && write_folder_records(records, "NEW", 1) == 1;
+    std::vector<std::string> got = records_of(records), expected = records_model(text);
+    if (got != expected) return "folder records differ from the model";
+    if (!written) return nullptr;
+    // Each record comes back, but one whose rewritten line outgrew what the
+    // reader takes (an empty size written as "0"): it is dropped as any such line.
+    expected.clear();
+    for (const std::string& r : got)
+        if (r.size() + 1 <= 254) expected.push_back(r);
+    expected.push_back("NEW 0");
+    return records_of(read_folder_records(1)) == expected ? nullptr : "folder records not read back as written";
+}
+
 }  // namespace
 
-int main(int argc, char** argv) {
-    double seconds = 10;
-    unsigned long seed = 0xd0f11e;
-    fuzz_start("storage_parse_fuzz", argc, argv, &seconds, &seed);
-    rng.seed(seed);
-    mkdir("/data/misc", 0771);
-    double deadline = fuzz_now() + seconds;
-    unsigned long i = 0;
-    for (; fuzz_now() < deadline; i++) {
-        std::string text = random_text();
-        std::string run = "/mnt/sdcard/" + std::string(pick(250), 'r') + "/";
-        std::vector<std::string> entries;
-        DumpEntry* list = parse_dump_list_text(text.data(), text.size(), "/mnt/sdcard", run.c_str());
-        for (DumpEntry* e = list; e != nullptr; e = e->next)
-            entries.push_back(std::string(e->source) + ">" + e->output + (e->dumper == dump_properties ? "P" : "F"));
-        free_dump_list(list);
-        FolderRecord* records = parse_folder_records(text.data(), text.size());
-        bool written = i % 16 == 0 && write_folder_records(records, "NEW", 1) == 1;
-        std::vector<std::string> got = records_of(records), expected = records_model(text);
-        if (got == expected && written) {
-            // Each record comes back, but one whose rewritten line outgrew what the
-            // reader takes (an empty size written as "0"): it is dropped as any such line.
-            expected.clear();
-            for (const std::string& r : got)
-                if (r.size() + 1 <= 254) expected.push_back(r);
-            expected.push_back("NEW 0");
-            got = records_of(read_folder_records(1));
-        }
-        if (entries != dump_model(text, run) || got != expected) {
-            fprintf(stderr, "storage_parse_fuzz: FAILED at iteration %lu (seed %lu): %s\ntext: \"%s\"\n", i, seed,
-                    got != expected ? "folder records" : "dump list", fuzz_printable(text).c_str());
-            abort();
-        }
-    }
-    printf("storage_parse_fuzz: %lu texts, no failure\n", i);
-    return 0;
-}
+int main(int argc, char** argv) { return fuzz_main("storage_parse_fuzz", argc, argv, 0xd0f11e, 5000, one_round); }

@@ -1,9 +1,6 @@
-// Helpers shared by the unit tests: files, history records, properties, child
-// processes and a run's control block. Every test runs in a throwaway phone,
-// so the real device paths are safe to write.
+// Helpers shared by the unit tests, which run in a throwaway phone: its device paths are safe to write.
 #pragma once
 
-#include <ctype.h>
 #include <dirent.h>
 #include <errno.h>
 #include <fcntl.h>
@@ -160,9 +157,7 @@ struct RunBlock {
     }
 };
 
-// The phone's logger devices at /dev/log of this throwaway phone, started anew
-// with emu_logger's options (such as "--size 8192 --no-system"); true once
-// they serve.
+// The phone's logger devices at /dev/log, started anew with emu_logger's options; true once they serve.
 inline bool start_logger_devices(const std::string& options = "") {
     std::string out;
     run_shell("umount -l /dev/log 2>/dev/null; mkdir -p /dev/log", &out);
