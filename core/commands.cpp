@@ -283,7 +283,7 @@ static const char* config_fault(const char* key, const char* value) {
         value_len >= static_cast<size_t>(CONFIG_FIELD_LEN) || key_len + value_len > 97) {
         return "too long";
     }
-    if (strcmp(key, "logpath") == 0 && !log_path_value_valid(value)) return "not an absolute path";
+    if (strcmp(key, "logpath") == 0) return log_path_value_fault(value);
     return nullptr;
 }
 

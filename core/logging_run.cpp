@@ -24,6 +24,7 @@
 #include "common/io_util.h"
 #include "common/unique_fd.h"
 #include "common/wlog.h"
+#include "config/log_path.h"
 #include "core/child_supervision.h"
 #include "core/log_controller.h"
 #include "platform/properties.h"
@@ -35,6 +36,10 @@
 
 #define RUN_FOLDER_ROOT "/qrvlog/tavlolog/"
 #define RUN_FOLDER_PATTERN "APLog_%Y_%m%d_%H%M%S/"
+
+// Every run folder below a usable log path can be published in a property.
+static_assert(LOG_PATH_MAX_LEN + sizeof(RUN_FOLDER_ROOT "APLog_2026_0304_070649/") - 1 == PROP_VALUE_LEN - 1,
+              "log path limit and run folder name disagree");
 
 constexpr useconds_t STOP_STEP_US = 100000;
 // Polls of `exited` after SIGUSR1: the collectors get at most 0.9 s.

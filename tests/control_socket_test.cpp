@@ -69,6 +69,7 @@ int squatter = -1;  // an app's socket holding "log_socket"
 // A message unsafe to store, or one that cannot be carried out, is refused
 // whole: ",0", the file as it was, no run (the message fuzzer checks the rules at large).
 TEST_F(ControlSocketTest, RefusedMessagesChangeNothing) {
+    const std::string too_long = "logpath=/mnt/" + std::string(47, 'p');  // a 52-character path
     const struct {
         std::string bytes, reply;  // exactly what the client writes; the text before ",0"
         const char* record;
@@ -77,6 +78,9 @@ TEST_F(ControlSocketTest, RefusedMessagesChangeNothing) {
         {std::string("AndroidLog=0\0start\0", 19), "AndroidLog=0", "(NUL byte)", nullptr},
         {std::string("logsize=1\nlogpath=/x\0", 21), "logsize=1\nlogpath=/x",
          "logsize=1\\x0alogpath=/x is not a valid configure (line feed)", nullptr},
+        {std::string("logpath=/data/misc//tqlog/logs\0", 31), "logpath=/data/misc//tqlog/logs",
+         "(the daemon's own folder)", nullptr},
+        {too_long + '\0', too_long, "(too long for a run folder)", nullptr},
         {std::string("start\0", 6), "start", "log_socket cannot be served, no run started",
          [] { squatter = socket_local_server("log_socket", ANDROID_SOCKET_NAMESPACE_ABSTRACT, SOCK_STREAM); }},
     };
