@@ -328,6 +328,6 @@ int apply_config_message(LogController* controller, char* text) {
     WLOG(TAG_MAIN, WLOG_DEBUG, "new config, key: %s, value:%s", real_key, value);
     ConfigCache cache;
     config_init(&cache);
-    config_change(&cache, real_key, value);
-    return 1;
+    // A setting the file did not take is not stored, whatever the cache says.
+    return config_change(&cache, real_key, value);
 }

@@ -81,8 +81,13 @@ TEST_F(ControlSocketTest, RefusedMessagesChangeNothing) {
         {std::string("logpath=/data/misc//tqlog/logs\0", 31), "logpath=/data/misc//tqlog/logs",
          "(the daemon's own folder)", nullptr},
         {too_long + '\0', too_long, "(too long for a run folder)", nullptr},
+        {std::string("BTLog=1\0", 8), "BTLog=1", "cant open the config file,errno=17",
+         [] { mkdir(CONFIG_FILE ".tmp", 0700); }},
         {std::string("start\0", 6), "start", "log_socket cannot be served, no run started",
          [] { squatter = socket_local_server("log_socket", ANDROID_SOCKET_NAMESPACE_ABSTRACT, SOCK_STREAM); }},
+        // Without a file the default "1" is no change, and still not stored.
+        {std::string("BTLog=1\0", 8), "BTLog=1", "some thing wrong when read",
+         [] { unlink(CONFIG_FILE), mkdir(CONFIG_FILE, 0700); }},
     };
     for (const auto& c : cases) {
         if (c.setup) c.setup();
