@@ -24,16 +24,22 @@
 #include "common/io_util.h"
 #include "common/unique_fd.h"
 #include "common/wlog.h"
+#include "config/log_path.h"
 #include "core/child_supervision.h"
 #include "core/log_controller.h"
 #include "platform/properties.h"
 #include "storage/folder_records.h"
 #include "storage/history_log.h"
+#include "storage/record_limit.h"
 #include "storage/safe_file.h"
 #include "transist/transist.h"
 
 #define RUN_FOLDER_ROOT "/qrvlog/tavlolog/"
 #define RUN_FOLDER_PATTERN "APLog_%Y_%m%d_%H%M%S/"
+
+// Every run folder below a usable log path can be published in a property.
+static_assert(LOG_PATH_MAX_LEN + sizeof(RUN_FOLDER_ROOT "APLog_2026_0304_070649/") - 1 == PROP_VALUE_LEN - 1,
+              "log path limit and run folder name disagree");
 
 constexpr useconds_t STOP_STEP_US = 100000;
 // Polls of `exited` after SIGUSR1: the collectors get at most 0.9 s.
@@ -61,6 +67,41 @@ void compose_run_folder(LogController* controller) {
     HLOG(TAG_MAIN, WLOG_INFO, "full path is:%s", controller->run_folder);
 }
 
+// Any app that can write the card can plant links there, as often as it likes.
+static RecordLimit removed_links = RECORD_LIMIT(TAG_MAIN, "removed links");
+
+// A link where the daemon's own folders ("qrvlog", "tavlolog") belong would be
+// refused, and so block every run until someone removed it: the link itself
+// goes (never what it points to), and the folder is made in its place.
+static void remove_planted_links(const char* base, const char* folder) {
+    size_t base_len = strlen(base);
+    while (base_len > 0 && base[base_len - 1] == '/') base_len--;
+    char own[PATH_LEN];
+    int own_len = snprintf(own, sizeof(own), "%.*s" RUN_FOLDER_ROOT, static_cast<int>(base_len), base);
+    if (own_len < 0 || own_len >= PATH_LEN || strncmp(folder, own, static_cast<size_t>(own_len)) != 0) return;
+    // The base is trusted as it stands, links and all.
+    UniqueFd dir(RETRY_EINTR(open(base_len == 0 ? "/" : base, O_PATH | O_DIRECTORY | O_CLOEXEC)));
+    size_t shown_len = base_len;
+    static const char* const OWN_FOLDERS[] = {"qrvlog", "tavlolog"};
+    for (const char* name : OWN_FOLDERS) {
+        shown_len += 1 + strlen(name);
+        struct stat st;
+        if (!dir.ok() || fstatat(dir.get(), name, &st, AT_SYMLINK_NOFOLLOW) != 0) return;
+        if (S_ISLNK(st.st_mode)) {
+            if (safe_remove_file(dir.get(), name) == 0) {
+                HLOG_LIMITED(removed_links, TAG_MAIN, WLOG_WARN, "%.*s is a symbolic link, removed",
+                             static_cast<int>(shown_len), own);
+            } else {
+                int err = errno;
+                HLOG_LIMITED(removed_links, TAG_MAIN, WLOG_ERROR, "remove link %.*s failed(%s)",
+                             static_cast<int>(shown_len), own, strerror(err));
+            }
+            return;
+        }
+        dir.reset(RETRY_EINTR(openat(dir.get(), name, O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC)));
+    }
+}
+
 int create_run_folder(LogController* controller, const char* base, const char* path) {
     char folder[PATH_LEN];
     size_t len = strnlen(path, PATH_LEN);
@@ -74,6 +115,7 @@ int create_run_folder(LogController* controller, const char* base, const char* p
     if (needs_slash) folder[len++] = '/';
     folder[len] = '\0';
 
+    remove_planted_links(base, folder);
     // base is trusted as it stands (a log path may be a link); below it an
     // app that can write the card may have planted links: none is followed.
     char failed_at[PATH_LEN];

@@ -61,7 +61,8 @@ TEST(CreateRunFolder, CreatesEveryMissingFolderWithGroupAccessOrRefuses) {
     umask(077);
     LogController controller;
     write_file("/data/blocker", "");
-    ASSERT_EQ(system("mkdir -p /data/elsewhere /mnt/sdcard/qrvlog && ln -s /data/elsewhere /mnt/sdcard/qrvlog/next"), 0);
+    ASSERT_EQ(system("mkdir -p /data/elsewhere /mnt/sdcard/qrvlog /mnt/sdcard/other && ln -s /data/elsewhere /mnt/sdcard/qrvlog/next"
+                     " && ln -s /data/elsewhere /mnt/sdcard/qrvlog/tavlolog && ln -s /data/elsewhere /mnt/sdcard/other/qrvlog"), 0);
     const std::string too_long = "/data/" + std::string(249, 'y'), too_long_part = too_long.substr(0, 200);
     const struct {
         const char *base, *path;
@@ -73,6 +74,9 @@ TEST(CreateRunFolder, CreatesEveryMissingFolderWithGroupAccessOrRefuses) {
         {"/mnt/sdcard/deep", "/mnt/sdcard/deep/a/b/c", 1, "/mnt/sdcard/deep"},
         {"/data", "/data/blocker/run", -1, "/data/blocker/run"},
         {"/mnt/sdcard", "/mnt/sdcard/qrvlog/next/APLog_1/", -1, "/data/elsewhere/APLog_1"},
+        // A link planted where the daemon's own folders belong goes, not what it points to.
+        {"/mnt/sdcard", "/mnt/sdcard/qrvlog/tavlolog/APLog_2/", 1, "/mnt/sdcard/qrvlog/tavlolog/APLog_2"},
+        {"/mnt/sdcard/other/", "/mnt/sdcard/other/qrvlog/tavlolog/APLog_3", 1, "/mnt/sdcard/other/qrvlog/tavlolog"},
         {"/data", too_long.c_str(), -1, too_long_part.c_str()},  // 255 characters: no room for '/' 
     };
     for (const auto& c : cases) {
@@ -80,6 +84,8 @@ TEST(CreateRunFolder, CreatesEveryMissingFolderWithGroupAccessOrRefuses) {
         EXPECT_EQ(mode_of(c.check), c.result == 1 ? 0770u : 0u) << c.check;
     }
     EXPECT_EQ(mode_of("/mnt/sdcard/deep/a/b/c"), 0770u);
+    EXPECT_TRUE(exists("/data/elsewhere") && files_in("/data/elsewhere").empty());
+    EXPECT_TRUE(history_has("/mnt/sdcard/qrvlog/tavlolog is a symbolic link, removed"));
 }
 
 // The run's folder is named after its start time; a log path that leaves no
