@@ -304,7 +304,10 @@ void LogCat::read_log_lines() {
             ready = pselect(maxfd + 1, &readable, nullptr, nullptr, wait_forever ? nullptr : &batch,
                             &wait_mask);
         } while (ready < 0 && errno == EINTR && !stop_signalled);
-        if (ready < 0) continue;
+        if (ready < 0) {
+            if (errno != EINTR) back_off_after_failed_wait(this, errno, &wait_mask);
+            continue;
+        }
 
         if (ready == 0) {
             // Quiet for the batching time: nothing older can still come.
