@@ -46,11 +46,15 @@ static void note_death(LogController* controller, pid_t* pid, int slot) {
 
 static bool is_dead(pid_t pid) { return kill(pid, 0) != 0; }
 
-void check_children(LogController* controller) {
+void reap_children() {
     pid_t pid;
     while ((pid = waitpid(-1, nullptr, WNOHANG)) > 0) {
         HLOG(TAG_MAIN, WLOG_ERROR, " pid %d send sig_chld ", pid);
     }
+}
+
+void check_children(LogController* controller) {
+    reap_children();
 
     if (all_pids_clear(controller)) {
         HLOG(TAG_MAIN, WLOG_ERROR, "all processes die, no need to check");

@@ -261,7 +261,11 @@ static void discard_stale_notices() {
 
 void stop_logging(LogController* controller) {
     // The collectors ended below are reaped by the system and start no check.
+    // One that died before (its notice not handled yet) is still a zombie,
+    // which the system leaves: it is reaped here with its record, not
+    // silently by the signalling below.
     signal(SIGCHLD, SIG_IGN);
+    reap_children();
     // The daemon's own record decides: the property may have been set by hand.
     if (!controller->run_active) {
         controller->log_path_state = -1;
