@@ -83,6 +83,8 @@ void check_children(LogController* controller) {
         note_death(controller, &controller->blog_pid, SLOT_BT);
     }
 
+    // A death is otherwise silent while the others go on: it shows in the property.
+    publish_collectors(controller);
     if (all_pids_clear(controller)) {
         HLOG(TAG_MAIN, WLOG_ERROR, "all chil processes die");
         reply_client(controller, -1, "tqlog_stopped");
