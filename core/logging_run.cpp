@@ -196,6 +196,28 @@ static void create_control_block(LogController* controller) {
     WLOG(TAG_MAIN, WLOG_DEBUG, "create shared memory ok!");
 }
 
+void publish_collectors(const LogController* controller) {
+    const struct {
+        const char* name;
+        int enabled;
+        pid_t pid;
+    } collectors[LOG_TYPE_COUNT] = {
+        {"main", controller->android_log, controller->mlog_pid},
+        {"radio", controller->android_log, controller->rlog_pid},
+        {"events", controller->android_log, controller->elog_pid},
+        {"kernel", controller->kernel_log, controller->klog_pid},
+        {"bt", controller->bt_log, controller->blog_pid},
+    };
+    char value[PROPERTY_VALUE_MAX] = {};  // at most 52 characters
+    size_t used = 0;
+    for (const auto& c : collectors) {
+        const char* state = !c.enabled ? "off" : c.pid != 0 ? "up" : "down";
+        int n = snprintf(value + used, sizeof(value) - used, "%s%s=%s", used ? "," : "", c.name, state);
+        if (n > 0) used += static_cast<size_t>(n);
+    }
+    property_set(PROP_COLLECTORS, value);
+}
+
 static void mark_not_started(LogController* controller, int slot) {
     controller->shm->slots[slot].exited = 1;
 }
@@ -238,6 +260,7 @@ void start_logging(LogController* controller) {
 
     HLOG(TAG_MAIN, WLOG_INFO, "M(%d),R(%d),E(%d),K(%d),B(%d)", controller->mlog_pid,
          controller->rlog_pid, controller->elog_pid, controller->klog_pid, controller->blog_pid);
+    publish_collectors(controller);
 }
 
 static bool all_collectors_exited(const LogController* controller) {
@@ -303,7 +326,11 @@ static void discard_stale_notices() {
 
 void stop_logging(LogController* controller) {
     // The collectors ended below are reaped by the system and start no check.
+    // One that died before (its notice not handled yet) is still a zombie,
+    // which the system leaves: it is reaped here with its record, not
+    // silently by the signalling below.
     signal(SIGCHLD, SIG_IGN);
+    reap_children();
     // The daemon's own record decides: the property may have been set by hand.
     if (!controller->run_active) {
         controller->log_path_state = -1;
@@ -312,6 +339,7 @@ void stop_logging(LogController* controller) {
         return;
     }
     property_set(PROP_RUNNING, "0");
+    property_set(PROP_COLLECTORS, "");
 
     if (controller->shm != nullptr) {
         int locked = control_block_lock(controller->sem);

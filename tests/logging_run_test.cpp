@@ -212,6 +212,17 @@ TEST_F(RunTest, StopKeepsEverythingTheCollectorSent) {
     EXPECT_NE(kill(collector, 0), 0) << "the stop left a collector behind";
 }
 
+// A collector that died just before the stop, its notice not handled yet.
+TEST_F(RunTest, StopRecordsACollectorThatDiedJustBefore) {
+    start_logging(&controller_);
+    pid_t collector = controller_.klog_pid;
+    ASSERT_EQ(kill(collector, SIGKILL), 0);
+    siginfo_t info;
+    ASSERT_EQ(waitid(P_PID, collector, &info, WEXITED | WNOWAIT), 0);  // dead, not reaped
+    stop_logging(&controller_);
+    EXPECT_TRUE(has_record(" pid " + std::to_string(collector) + " send sig_chld "));
+}
+
 std::string fd_target(pid_t pid, int fd) {
     char target[PATH_MAX] = {};
     std::string link = "/proc/" + std::to_string(pid) + "/fd/" + std::to_string(fd);
