@@ -128,6 +128,10 @@ TEST(UpdateFolderRecords, RecordsTheNewFolderLastWithinTheBudget) {
         for (const std::string& record : c.records) EXPECT_TRUE(has_record(record)) << record;
         for (const auto& folder : c.on_card) EXPECT_TRUE(exists(kParent + folder.first));
     }
+    // A parent that cannot be opened: the record says which.
+    ASSERT_EQ(0, system("rm -rf /mnt/sdcard/qrvlog"));
+    EXPECT_EQ(0, update_folder_records("/mnt/sdcard", (kParent + "D/").c_str(), 1, 600, 300));
+    EXPECT_TRUE(has_record("open " + kParent + " fail No such file or directory"));
 }
 
 using Files = std::map<std::string, std::string>;
