@@ -18,10 +18,15 @@ SCENARIOS(Boot, {
       {"has", "/data/misc/tqlog/inter_sd_folder", "APLog_"}}},
     {"DataPathRecordsOnData", {{kOn.first, kOn.second + "qrvlog_path=/data\n"}}, {},
      {{"hist", "mkdir /data/qrvlog/tavlolog/APLog_"}, {"hist", " M("}}},
-    // init restarts a crashed daemon within the boot: what it held stays.
-    {"RestartKeepsTheHeldLogs", {kOn}, {},
+    // init restarts a crashed daemon within the boot: what it held stays; a
+    // boot that ends before any copy has its held logs brought by the next one.
+    {"RestartOrRebootBeforeACopyKeepsTheHeldLogs", {kOn}, {},
      {{"kmsg", "before the crash\n"}, {"has", "/data/log_temp/kernel_log", "before the crash"}, {"crash"},
-      {"kmsg", "after\n"}, {"has", "/data/log_temp/kernel_log", "before the crash\n" + H + "after\n"}}},
+      {"kmsg", "after\n"}, {"has", "/data/log_temp/kernel_log", "before the crash\n" + H + "after\n"},
+      {"boot", "0"}, {"hist", "held logs of the previous boot kept in /data/log_temp_prev/"},
+      {"kmsg", "next boot\n"}, {"has", "/data/log_temp/kernel_log", "next boot"}, {"ctl", "copy"},
+      {"is", "$RUN/kernel_log.prev_boot", N + H + "before the crash\n" + H + "after\n"},
+      {"has", "$RUN/kernel_log.boot", N + H + "next boot\n"}, {"gone", "/data/log_temp_prev"}}},
     {"LowDataStartsNoRun", {kOn}, {"--data-size", "8"},
      {{"hist", "/data is low, dont start children process(2)"}, {"ctl", "stop"}, {"gone", "/data/log_temp"},
       {"hist", " M(", "0"}}},
