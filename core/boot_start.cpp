@@ -173,6 +173,9 @@ struct BootNumbers {
     int values[256];
 };
 
+// A gap of numbers no folder holds (a folder made by hand) is not worth more.
+constexpr int PRUNE_RECORDS_MAX = 64;
+
 int collect_boot_number(void* arg, const char* name, int) {
     BootNumbers* numbers = static_cast<BootNumbers*>(arg);
     int n = other_mode_number(name);
@@ -182,9 +185,41 @@ int collect_boot_number(void* arg, const char* name, int) {
     return 0;
 }
 
+int by_number(const void* a, const void* b) {
+    int x = *static_cast<const int*>(a), y = *static_cast<const int*>(b);
+    return x < y ? -1 : x > y ? 1 : 0;
+}
+
+// Every number from the lowest to max - 2 goes, in ascending order, each with
+// its record, whether a folder holds it or not.
+void prune_other_modes(int dir, BootNumbers* numbers) {
+    if (numbers->count == 0) return;
+    qsort(numbers->values, static_cast<size_t>(numbers->count), sizeof(int), by_number);
+    int next = 0, recorded = 0, unrecorded = 0;
+    for (int n = numbers->values[0]; n <= numbers->max - 2; n++) {
+        bool present = false;
+        for (; next < numbers->count && numbers->values[next] <= n; next++) present |= numbers->values[next] == n;
+        if (!present && recorded >= PRUNE_RECORDS_MAX) {
+            unrecorded++;
+            continue;
+        }
+        recorded++;
+        HLOG(TAG_MAIN, WLOG_ERROR, "rm -r %s%d", OTHER_MODE_FOLDER, n);
+        char name[16];
+        snprintf(name, sizeof(name), "%d", n);
+        if (present && safe_remove_tree(dir, name) != 0 && errno != ENOENT) {
+            int err = errno;
+            HLOG(TAG_MAIN, WLOG_ERROR, "rm -r %s%d failed(%s)", OTHER_MODE_FOLDER, n, strerror(err));
+        }
+    }
+    if (unrecorded > 0)
+        HLOG(TAG_MAIN, WLOG_ERROR, "%d more numbers up to %d held no folder", unrecorded, numbers->max - 2);
+}
+
 // The number of this boot's folder: one past the highest of the earlier
-// boots, whose two newest folders are kept. -1 when they cannot be listed.
-int next_other_mode_number() {
+// boots, whose two newest folders are kept. A daemon restarted within the boot
+// goes on in its boot's folder and removes nothing. -1 when they cannot be listed.
+int next_other_mode_number(bool restarted) {
     if (!exists(OTHER_MODE_FOLDER)) return 1;
     BootNumbers numbers;
     UniqueFd dir(safe_open_dir("/data", OTHER_MODE_FOLDER, false, 0));
@@ -192,17 +227,11 @@ int next_other_mode_number() {
         HLOG(TAG_MAIN, WLOG_ERROR, "opendir /data/log_otherboot failed");
         return -1;
     }
-    for (int i = 0; i < numbers.count; i++) {
-        int n = numbers.values[i];
-        if (n > numbers.max - 2) continue;
-        char name[16];
-        snprintf(name, sizeof(name), "%d", n);
-        HLOG(TAG_MAIN, WLOG_ERROR, "rm -r %s%d", OTHER_MODE_FOLDER, n);
-        if (safe_remove_tree(dir.get(), name) != 0 && errno != ENOENT) {
-            int err = errno;
-            HLOG(TAG_MAIN, WLOG_ERROR, "rm -r %s%d failed(%s)", OTHER_MODE_FOLDER, n, strerror(err));
-        }
+    if (restarted && numbers.max > 0) {
+        HLOG(TAG_MAIN, WLOG_ERROR, "restarted within this boot, %s%d/ kept", OTHER_MODE_FOLDER, numbers.max);
+        return numbers.max;
     }
+    prune_other_modes(dir.get(), &numbers);
     return numbers.max + 1;
 }
 
@@ -214,13 +243,15 @@ void other_boot(LogController* controller, ConfigCache* config) {
         return;
     }
     copy_str(controller->logpath, sizeof(controller->logpath), "/data");
-    int number = next_other_mode_number();
+    remove_stray("log_other_mode");
+    int number = next_other_mode_number(restarted_in_this_boot());
     if (number < 0) return;
     snprintf(controller->run_folder, sizeof(controller->run_folder), "%s%d/", OTHER_MODE_FOLDER, number);
     if (create_run_folder(controller, "/data", controller->run_folder) < 0) {
         HLOG(TAG_MAIN, WLOG_ERROR, "mkdir %s failed", controller->run_folder);
         return;
     }
+    property_set(PROP_BOOTED, "1");
     HLOG(TAG_MAIN, WLOG_ERROR, "%s", controller->run_folder);
     bluetooth_off(controller);
     controller->boot_copy_timer = 0;
