@@ -109,6 +109,7 @@ int create_run_folder(LogController* controller, const char* base, const char* p
     if (len + (needs_slash ? 1 : 0) >= static_cast<size_t>(PATH_LEN)) {
         HLOG(TAG_MAIN, WLOG_ERROR, "mkdir %.64s... refused: longer than %d characters", path,
              PATH_LEN - 1);
+        errno = ENAMETOOLONG;
         return -1;
     }
     memcpy(folder, path, len);
@@ -124,10 +125,12 @@ int create_run_folder(LogController* controller, const char* base, const char* p
         int err = path[0] == '\0' ? EINVAL : errno;
         if (err == EINVAL && failed_at[0] == '\0') {
             HLOG(TAG_MAIN, WLOG_ERROR, "mkdir %s refused: not under %s", folder, base);
+            errno = EINVAL;
             return -1;
         }
         HLOG(TAG_MAIN, WLOG_ERROR, "mkdir %s fails, errno:%s(%d)", failed_at, strerror(err), err);
         HLOG(TAG_MAIN, WLOG_ERROR, "mkdir %s fails at last", folder);
+        errno = err;  // the records may have changed it; the caller reports it
         return -1;
     }
     HLOG(TAG_MAIN, WLOG_INFO, "mkdir %s success", folder);

@@ -11,6 +11,7 @@
 #include "collectors/kmsg_cat.h"
 #include "config/config_store.h"
 #include "core/boot_mode.h"
+#include "core/boot_start.h"
 #include "core/child_supervision.h"
 #include "core/log_controller.h"
 #include "test_util.h"
@@ -109,6 +110,51 @@ TEST(RunFolder, NamedAfterTheStartTimeAndPublished) {
     EXPECT_EQ(property(PROP_REALPATH), "/mnt/sdcard/qrvlog/tavlolog/APLog_2026_0304_070649/");
     publish_run_folder(&controller, ("/mnt/" + std::string(90, 'd') + "/qrvlog/tavlolog/APLog_2026_0304_070650/").c_str());
     EXPECT_EQ(property(PROP_REALPATH), "") << "the earlier run's folder would receive this run's records";
+}
+
+// The first daemon of a boot keeps aside what the boot before held and never
+// copied, while /data keeps the holding folder's room; a stray where the
+// folder belongs goes; a folder that cannot be made leaves the boot copy
+// nothing to wait for unless a previous boot's logs are held.
+TEST(StartInTempFolder, KeepsThePreviousBootsHeldLogsAside) {
+    SKIP_OUTSIDE_PHONE();
+    const std::string held_before = "mkdir /data/log_temp_prev /data/log_temp && touch /data/log_temp_prev/old /data/log_temp/kernel_log";
+    const std::string no_inode = "mkdir -p /data/misc/tqlog && touch " + std::string(kHistory) + " && while touch /data/f$((i=i+1)); do :; done";
+    const struct {
+        const char* mount;  // options of the tmpfs /data
+        const char* booted;
+        std::string setup;
+        int result;
+        const char *temp, *prev;  // their files afterwards, "-": no folder
+        uint8_t timer;
+        const char* record;
+    } cases[] = {
+        {"size=200m", "0", held_before, 1, "", "kernel_log", 1, "held logs of the previous boot kept in /data/log_temp_prev/"},
+        {"size=20m", "0", held_before, 1, "", "-", 1, "held logs of the previous boot dropped, /data has "},
+        {"size=200m", "0", "mkdir /data/log_temp && touch /data/log_temp/.x", 1, "", "-", 1, ""},
+        {"size=200m", "0", "echo x > /data/log_temp", 1, "", "-", 1, "/data/log_temp is not a folder, will delete it"},
+        {"size=200m", "1", "ln -s /nowhere /data/log_temp", 1, "", "-", 1, "/data/log_temp is not a folder, will delete it"},
+        {"size=200m,nr_inodes=16", "0", no_inode, 0, "-", "-", 0, "mkdir /data/log_temp/ faild,errno=28"},
+        {"size=200m,nr_inodes=16", "0", "mkdir /data/log_temp && touch /data/log_temp/kernel_log && " + no_inode, 0, "-", "kernel_log", 1, ""},
+    };
+    auto files = [](const std::string& dir) {
+        std::string names = exists(dir) ? "" : "-";
+        for (const std::string& name : files_in(dir)) names += (names.empty() ? "" : " ") + name;
+        return names;
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.setup);
+        ASSERT_EQ(0, system(("umount /data 2>/dev/null; mount -t tmpfs -o " + std::string(c.mount) + " tmpfs /data && " + c.setup + " 2>/dev/null; true").c_str()));
+        property_set(PROP_BOOTED, c.booted);
+        LogController controller;
+        controller.boot_mode = 0;
+        EXPECT_EQ(c.result, start_in_temp_folder(&controller));
+        EXPECT_EQ(c.temp, files("/data/log_temp"));
+        EXPECT_EQ(c.prev, files("/data/log_temp_prev"));
+        EXPECT_EQ(c.timer, controller.boot_copy_timer);
+        EXPECT_TRUE(history_has(c.record)) << c.record;
+    }
+    system("umount /data");
 }
 
 TEST(SignalChild, NeverSignalsTheDaemonsOwnGroup) {
