@@ -233,7 +233,7 @@ function drawList() {
         r.entry = e;
         r.style.display = "";
         r.style.top = (k * ROW_H + shift) + "px";
-        r.className = "row k" + kind(e) + (p >= 0 ? " p" + p : "") + (e === selected ? " sel" : "");
+        r.className = "row k" + kind(e) + (p >= 0 ? " p" + p : "") + (i & 1 ? " odd" : "") + (e === selected ? " sel" : "");
         c[0].textContent = fmtTime(e);
         c[1].textContent = SRC[src(e)];
         c[1].style.color = SRC_COLOR[src(e)];
@@ -340,7 +340,7 @@ function drawLanes(g, w, y0, lanes, col) {
             if (!n) continue;
             g.globalAlpha = 0.35 + 0.65 * Math.log(n + 1) / lm;
             g.fillStyle = CLS_COLOR[col.worst[l * w + x]];
-            g.fillRect(x, y + 3, 1, LANE_H - 6);
+            g.fillRect(x, y + 3, 2, LANE_H - 6);  // 2 px: a lone entry stays visible
         }
         g.globalAlpha = 1;
     }
@@ -352,8 +352,9 @@ function drawAxis(g, w, y, v, fmt, minPx, shift) {
     g.strokeStyle = "#d0d7de"; g.beginPath();
     for (let t = Math.ceil((v[0] + shift) / step) * step - shift; t <= v[1]; t += step) {
         const x = Math.round((t - v[0]) / (v[1] - v[0]) * w) + 0.5;
+        const label = fmt(t, step);
         g.moveTo(x, y); g.lineTo(x, y + 4);
-        g.fillText(fmt(t, step), x + 3, y + AXIS_H / 2 + 1);
+        if (x + 3 + g.measureText(label).width <= w) g.fillText(label, x + 3, y + AXIS_H / 2 + 1);
     }
     g.stroke();
 }
@@ -499,13 +500,24 @@ function clampView(d) {
 let frame = 0;
 const redraw = () => { if (!frame) frame = requestAnimationFrame(() => { frame = 0; drawCharts(); }); };
 
-function jumpTo(d, t) {
+// The list jumps to the first shown entry at or after T; a click also selects it.
+function jumpTo(d, t, pick) {
     const idx = d === "r" ? selR : selW;
     if (!idx.length) return;
     const e = idx[Math.min(idx.length - 1, lowerBound(idx, t))];
     scrollToRow(selIndexOf(e));
-    select(e);
+    if (pick) select(e);
 }
+// The timeline follows the list: the entry at the top of the list stays in view.
+function follow() {
+    if (!sel.length) return;
+    const e = sel[Math.min(topRow, sel.length - 1)], d = isRel(e) ? "r" : "w", v = view[d], t = TM[e];
+    if (t >= v[0] && t <= v[1]) return;
+    const span = v[1] - v[0];
+    v[0] = t - span / 2; v[1] = t + span / 2;
+    clampView(d);
+}
+const centre = d => (view[d][0] + view[d][1]) / 2;
 
 for (const [c, only] of [[tl, null], [hg, "w"]]) {
     c.addEventListener("wheel", ev => {
@@ -514,6 +526,7 @@ for (const [c, only] of [[tl, null], [hg, "w"]]) {
         if (Math.abs(ev.deltaX) > Math.abs(ev.deltaY) || ev.shiftKey) {
             const v = view[d], dx = (ev.deltaX || ev.deltaY) / r.width * (v[1] - v[0]);
             v[0] += dx; v[1] += dx; clampView(d);
+            jumpTo(d, centre(d), false);
         } else {
             zoom(d, ev.clientX - r.left, r.width, Math.pow(1.0015, ev.deltaY));
         }
@@ -543,14 +556,16 @@ for (const [c, only] of [[tl, null], [hg, "w"]]) {
                 const b = boots.find(o => o.first <= t && t <= o.last);
                 if (b) { const m = (b.last - b.first) * 0.02 + 500; v[0] = b.first - m; v[1] = b.last + m; clampView("w"); redraw(); }
             } else {
-                jumpTo(drag.d, v[0] + (v[1] - v[0]) * (ev.clientX - r.left) / r.width);
+                jumpTo(drag.d, v[0] + (v[1] - v[0]) * (ev.clientX - r.left) / r.width, true);
             }
+        } else if (drag) {
+            jumpTo(drag.d, centre(drag.d), false);  // a pan moves the list to the middle of the view
         }
         drag = null;
     });
 }
 
-list.addEventListener("scroll", () => drawList());
+list.addEventListener("scroll", () => { drawList(); follow(); });
 list.addEventListener("keydown", ev => {
     if (ev.key !== "ArrowDown" && ev.key !== "ArrowUp") return;
     ev.preventDefault();
