@@ -75,6 +75,12 @@ class Merger {
   public:
     Merger(const Filter& filter, Sink* sink) : filter_(filter), sink_(sink) {}
 
+    // A section is announced with its first entry that passes the filters.
+    void begin(const SectionInfo& info) {
+        section_ = info;
+        announced_ = false;
+    }
+
     // Emits everything the lanes hold now, in order.
     void drain(Lanes& lanes) {
         size_t n = lanes.size();
@@ -97,7 +103,11 @@ class Merger {
                 if (has_[i]) best = static_cast<int>(i);
             if (best < 0) return;
             const Entry& e = lanes[best]->entry();
-            if (filter_.match(e)) sink_->entry(e);
+            if (filter_.match(e)) {
+                if (!announced_) sink_->section(section_);
+                announced_ = true;
+                sink_->entry(e);
+            }
             has_[best] = 0;
         }
     }
@@ -106,6 +116,8 @@ class Merger {
     const Filter& filter_;
     Sink* sink_;
     std::vector<char> has_;
+    SectionInfo section_;
+    bool announced_ = true;
 };
 
 // The section's lanes in the order of the run's files.
@@ -124,7 +136,7 @@ std::string parent_of(const std::string& run_path) {
 }
 
 // Reads one run; when following, its run section stays open in `live`.
-void read_run(const std::string& path, const Filter& filter, Merger* merger, Sink* sink, bool follow,
+void read_run(const std::string& path, const Filter& filter, Merger* merger, bool follow,
               Lanes* live, std::unique_ptr<LaneContext>* live_context) {
     RunSpec run;
     if (!scan_run(path, &run)) return;
@@ -142,7 +154,7 @@ void read_run(const std::string& path, const Filter& filter, Merger* merger, Sin
                                    : "that boot's start is not recorded");
         }
         SectionInfo info{run.name, run.path, section.boot, section.name, context->has_boot_wallclock, section.same_boot};
-        sink->section(info);
+        merger->begin(info);
         Lanes lanes;
         open_lanes(section, context.get(), &lanes);
         bool stays = follow && section.boot == 0;
@@ -170,7 +182,7 @@ void read_timeline(const std::vector<std::string>& runs, const Filter& filter, S
     Lanes live;
     std::unique_ptr<LaneContext> live_context;
     for (size_t i = 0; i < runs.size(); i++)
-        read_run(runs[i], filter, &merger, sink, follow.follow && i + 1 == runs.size(), &live, &live_context);
+        read_run(runs[i], filter, &merger, follow.follow && i + 1 == runs.size(), &live, &live_context);
     if (!follow.follow || runs.empty()) return;
     std::string current = runs.back();
     int looks = 0;
@@ -189,7 +201,7 @@ void read_timeline(const std::vector<std::string>& runs, const Filter& filter, S
         warn("%s ended; following %s", current.c_str(), next.c_str());
         live.clear();
         current = next;
-        read_run(current, filter, &merger, sink, true, &live, &live_context);
+        read_run(current, filter, &merger, true, &live, &live_context);
     }
     sink->idle();
 }
