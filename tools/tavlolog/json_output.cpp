@@ -4,6 +4,7 @@
 
 #include "tools/tavlolog/line_parse.h"
 #include "tools/tavlolog/output.h"
+#include "tools/tavlolog/text_scan.h"
 
 namespace tavlolog {
 
@@ -17,11 +18,9 @@ void append_string(std::string& out, std::string_view s) {
     const unsigned char* end = p + s.size();
     const unsigned char* plain = p;
     while (p < end) {
+        p = plain_until(p, end, true);
+        if (p == end) break;
         unsigned char c = *p;
-        if (c >= 0x20 && c < 0x7f && c != '"' && c != '\\') {
-            p++;
-            continue;
-        }
         if (c >= 0x80) {
             int more = c >= 0xf0 && c < 0xf5 ? 3 : c >= 0xe0 && c < 0xf0 ? 2 : c >= 0xc2 && c < 0xe0 ? 1 : -1;
             bool whole = more > 0 && end - p > more;
@@ -47,12 +46,6 @@ void append_string(std::string& out, std::string_view s) {
     }
     out.append(reinterpret_cast<const char*>(plain), static_cast<size_t>(end - plain));
     out += '"';
-}
-
-void append_number(std::string& out, int64_t v) {
-    char text[24];
-    int n = snprintf(text, sizeof(text), "%lld", static_cast<long long>(v));
-    out.append(text, static_cast<size_t>(n));
 }
 
 class JsonOutput : public Sink {
@@ -82,10 +75,12 @@ class JsonOutput : public Sink {
         t += e.inherited ? "true" : "false";
         t += ",\"uptime\":";
         if (e.uptime_ns >= 0) {
-            char up[40];
-            snprintf(up, sizeof(up), "%lld.%09lld", static_cast<long long>(e.uptime_ns / 1000000000),
-                     static_cast<long long>(e.uptime_ns % 1000000000));
-            t += up;
+            append_number(t, e.uptime_ns / 1000000000);
+            t += '.';
+            char frac[9];
+            int64_t f = e.uptime_ns % 1000000000;
+            for (int i = 8; i >= 0; i--, f /= 10) frac[i] = static_cast<char>('0' + f % 10);
+            t.append(frac, 9);
         } else {
             t += "null";
         }

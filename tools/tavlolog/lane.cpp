@@ -259,7 +259,12 @@ void Lane::android_entry(const ParsedLine& p) {
         return;
     }
     int year = p.year != 0 ? p.year : year_of(p.month, p.day);
-    int64_t local = days_from_civil(year, p.month, p.day) * 86400 + p.hour * 3600 + p.minute * 60 + p.second;
+    int date = (year * 13 + p.month) * 32 + p.day;
+    if (date != cached_date_) {
+        cached_date_ = date;
+        cached_days_ = days_from_civil(year, p.month, p.day);
+    }
+    int64_t local = cached_days_ * 86400 + p.hour * 3600 + p.minute * 60 + p.second;
     int32_t off = zone_->offset_of_local(local);
     entry_.instant_ns = (local - off) * 1000000000 + p.nanos;
     entry_.has_instant = true;

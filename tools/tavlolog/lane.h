@@ -95,6 +95,8 @@ class Lane {
     int64_t last_instant_ = 0;
     int32_t last_offset_ = 0;
     int cached_md_ = -1, cached_year_ = 0;
+    int cached_date_ = -1;
+    int64_t cached_days_ = 0;
 };
 
 }  // namespace tavlolog

@@ -4,6 +4,7 @@
 #include <cstring>
 
 #include "tools/tavlolog/output.h"
+#include "tools/tavlolog/text_scan.h"
 
 namespace tavlolog {
 
@@ -18,11 +19,9 @@ void append_escaped(std::string& out, std::string_view s) {
     const unsigned char* plain = p;
     static const char kHex[] = "0123456789abcdef";
     while (p < end) {
+        p = plain_until(p, end, false);
+        if (p == end) break;
         unsigned char c = *p;
-        if (c >= 0x20 && c < 0x7f) {
-            p++;
-            continue;
-        }
         int more = c >= 0xf0 && c < 0xf5 ? 3 : c >= 0xe0 && c < 0xf0 ? 2 : c >= 0xc2 && c < 0xe0 ? 1 : -1;
         bool whole = more > 0 && end - p > more;
         for (int i = 1; whole && i <= more; i++) whole = (p[i] & 0xc0) == 0x80;
@@ -36,12 +35,6 @@ void append_escaped(std::string& out, std::string_view s) {
         plain = ++p;
     }
     out.append(reinterpret_cast<const char*>(plain), static_cast<size_t>(end - plain));
-}
-
-void append_int(std::string& out, int64_t v, int width) {
-    char text[24];
-    int n = snprintf(text, sizeof(text), "%*lld", width, static_cast<long long>(v));
-    out.append(text, static_cast<size_t>(n));
 }
 
 const char* colour_of(const Entry& e) {
@@ -98,9 +91,9 @@ class TextOutput : public Sink {
                                                                       : priority_letter(e.priority);
         t += ' ';
         if (e.pid >= 0) {
-            append_int(t, e.pid, 5);
+            append_number(t, e.pid, 5);
             t += ' ';
-            append_int(t, e.tid, 5);
+            append_number(t, e.tid, 5);
             t += ' ';
         }
         switch (e.kind) {
@@ -116,7 +109,7 @@ class TextOutput : public Sink {
                 t += e.kind == KIND_HEX ? "[" : "[malformed ";
                 t.append(e.file.data(), e.file.size());
                 t += '@';
-                t += std::to_string(e.offset);
+                append_number(t, static_cast<int64_t>(e.offset));
                 t += "] ";
                 break;
             default: break;
