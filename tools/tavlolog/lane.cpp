@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <algorithm>
 #include <cstring>
 
 #include "tools/tavlolog/warnings.h"
@@ -159,7 +160,38 @@ Lane::Read Lane::next_line(std::string_view* line, uint64_t* offset, const std::
     }
 }
 
+namespace {
+// The heap's order: the latest on top of std::*_heap is the earliest instant.
+bool later(const Lane::Held& a, const Lane::Held& b) { return a.key != b.key ? a.key > b.key : a.seq > b.seq; }
+}  // namespace
+
 bool Lane::next() {
+    if (untimed_) return read_one();
+    while (heap_.size() < kReorderEntries && heap_bytes_ < kReorderBytes && read_one()) {
+        Held h;
+        h.entry = entry_;
+        h.key = key_;
+        h.seq = seq_++;
+        h.tag.assign(entry_.tag.data(), entry_.tag.size());
+        h.message.assign(entry_.message.data(), entry_.message.size());
+        h.file.assign(entry_.file.data(), entry_.file.size());
+        heap_bytes_ += h.message.size() + h.tag.size() + sizeof(Held);
+        heap_.push_back(std::move(h));
+        std::push_heap(heap_.begin(), heap_.end(), later);
+    }
+    if (heap_.empty()) return false;
+    std::pop_heap(heap_.begin(), heap_.end(), later);
+    out_ = std::move(heap_.back());
+    heap_.pop_back();
+    heap_bytes_ -= out_.message.size() + out_.tag.size() + sizeof(Held);
+    // The views point into the copies, which stay until the next call.
+    out_.entry.tag = out_.tag;
+    out_.entry.message = out_.message;
+    out_.entry.file = out_.file;
+    return true;
+}
+
+bool Lane::read_one() {
     if (hex_done_ < hex_line_.size()) {
         size_t n = std::min(kHexChunk, hex_line_.size() - hex_done_);
         static const char kHex[] = "0123456789abcdef";
@@ -316,7 +348,7 @@ void Lane::bt_entry(std::string_view line, uint64_t offset) {
     hex_line_ = line;
     hex_offset_ = offset;
     hex_done_ = 0;
-    next();
+    read_one();
 }
 
 void Lane::set_zone(std::string_view name) {

@@ -42,12 +42,12 @@ class Lane {
     // Reads the next entry: true with it in entry(), false when the lane has
     // nothing more (for now, while following).
     bool next();
-    const Entry& entry() const { return entry_; }
+    const Entry& entry() const { return untimed_ ? entry_ : out_.entry; }
     // The lane's entries carry no comparable instant (Bluetooth bytes, kernel
     // lines without their boot's start): merged after the timed ones.
     bool untimed() const { return untimed_; }
     // The merge order: the instant, or that of the line before.
-    int64_t key() const { return key_; }
+    int64_t key() const { return untimed_ ? key_ : out_.key; }
     // From now on the run's file may grow: its end is not the end of the lane.
     void follow();
     // Following: picks up a rotation (the renamed file is read to its end
@@ -55,8 +55,22 @@ class Lane {
     // piece was added.
     bool poll();
 
+    // main_log holds two buffers whose lines the collector merges only in a short
+    // window: a lane puts up to this many lines back in order of their instants.
+    static constexpr size_t kReorderEntries = 4096;
+    static constexpr size_t kReorderBytes = 4 * 1024 * 1024;
+
+    // A line held for reordering, with its own copies of the texts.
+    struct Held {
+        Entry entry;
+        int64_t key = 0;
+        uint64_t seq = 0;
+        std::string tag, message, file;
+    };
+
   private:
     enum Read { GOT, NONE };
+    bool read_one();
     Read next_line(std::string_view* line, uint64_t* offset, const std::string** file);
     bool append_piece(const Piece& piece);
     void make_entry(std::string_view line, uint64_t offset, const std::string& file);
@@ -91,6 +105,10 @@ class Lane {
     bool untimed_ = false;
     Entry entry_;
     int64_t key_ = INT64_MIN;
+    std::vector<Held> heap_;  // min-heap by (key, seq)
+    size_t heap_bytes_ = 0;
+    uint64_t seq_ = 0;
+    Held out_;
     bool has_last_ = false;
     int64_t last_instant_ = 0;
     int32_t last_offset_ = 0;
