@@ -66,6 +66,8 @@ Lane::Lane(const LaneSpec& spec, const LaneContext* context)
     : source_(spec.source), context_(context), base_path_(spec.base_path), buf_(new char[kWindow]) {
     zone_.reset(new Zone("GMT"));
     untimed_ = source_ == SRC_BT || (source_ == SRC_KERNEL && !context->has_boot_wallclock);
+    // Only main_log merges two buffers; the other files are each one stream in order.
+    reorders_ = source_ == SRC_MAIN;
     final_ = true;
     // Every piece is opened now: a rotation while the folder is read then
     // cannot make one piece be read twice or another be missed.
@@ -166,7 +168,7 @@ bool later(const Lane::Held& a, const Lane::Held& b) { return a.key != b.key ? a
 }  // namespace
 
 bool Lane::next() {
-    if (untimed_) return read_one();
+    if (!reorders_) return read_one();
     while (heap_.size() < kReorderEntries && heap_bytes_ < kReorderBytes && read_one()) {
         Held h;
         h.entry = entry_;

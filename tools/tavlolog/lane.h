@@ -42,12 +42,12 @@ class Lane {
     // Reads the next entry: true with it in entry(), false when the lane has
     // nothing more (for now, while following).
     bool next();
-    const Entry& entry() const { return untimed_ ? entry_ : out_.entry; }
+    const Entry& entry() const { return reorders_ ? out_.entry : entry_; }
     // The lane's entries carry no comparable instant (Bluetooth bytes, kernel
     // lines without their boot's start): merged after the timed ones.
     bool untimed() const { return untimed_; }
     // The merge order: the instant, or that of the line before.
-    int64_t key() const { return untimed_ ? key_ : out_.key; }
+    int64_t key() const { return reorders_ ? out_.key : key_; }
     // From now on the run's file may grow: its end is not the end of the lane.
     void follow();
     // Following: picks up a rotation (the renamed file is read to its end
@@ -103,6 +103,7 @@ class Lane {
 
     std::unique_ptr<Zone> zone_;
     bool untimed_ = false;
+    bool reorders_ = false;
     Entry entry_;
     int64_t key_ = INT64_MIN;
     std::vector<Held> heap_;  // min-heap by (key, seq)

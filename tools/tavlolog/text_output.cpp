@@ -74,7 +74,7 @@ class TextOutput : public Sink {
         if (colour != nullptr) t += colour;
         if (e.has_instant) {
             time_.local(t, e.instant_ns, e.utc_offset_s, ' ', 6);
-        } else if (e.source == SRC_KERNEL && (e.uptime_ns >= 0 || e.inherited)) {
+        } else if (e.source == SRC_KERNEL && (e.uptime_ns >= 0 || (e.inherited && e.instant_ns > 0))) {
             int64_t up = e.uptime_ns >= 0 ? e.uptime_ns : e.instant_ns;
             char text[48];
             int n = snprintf(text, sizeof(text), "boot +%lld.%06lld", static_cast<long long>(up / 1000000000),
