@@ -62,8 +62,8 @@ int64_t floor_div(int64_t a, int64_t b) { return a >= 0 ? a / b : -((-a + b - 1)
 
 }  // namespace
 
-Lane::Lane(const LaneSpec& spec, const LaneContext* context)
-    : source_(spec.source), context_(context), base_path_(spec.base_path), buf_(new char[kWindow]) {
+Lane::Lane(const LaneFiles& files, const LaneContext* context)
+    : source_(files.source), context_(context), base_path_(files.base_path), buf_(new char[kWindow]) {
     zone_.reset(new Zone("GMT"));
     untimed_ = source_ == SRC_BT || (source_ == SRC_KERNEL && !context->has_boot_wallclock);
     // Only main_log merges two buffers; the other files are each one stream in order.
@@ -71,7 +71,7 @@ Lane::Lane(const LaneSpec& spec, const LaneContext* context)
     final_ = true;
     // Every piece is opened now: a rotation while the folder is read then
     // cannot make one piece be read twice or another be missed.
-    for (const Piece& piece : spec.pieces) {
+    for (const Piece& piece : files.pieces) {
         ino_t inode = 0;
         int fd = open_piece_fd(piece, &inode);
         if (fd < 0) continue;

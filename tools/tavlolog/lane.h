@@ -34,7 +34,7 @@ class Lane {
     // The window: the longest line read whole; longer ones are shown in pieces.
     static constexpr size_t kWindow = 256 * 1024;
 
-    Lane(const LaneSpec& spec, const LaneContext* context);
+    Lane(const LaneFiles& files, const LaneContext* context);
     ~Lane();
     Lane(const Lane&) = delete;
     Lane& operator=(const Lane&) = delete;

@@ -70,7 +70,7 @@ bool holds_logs(const std::string& path) {
 }
 
 // The last "[debug.TQ.boot_wallclock]: [VALUE]" of the run's properties.
-void read_boot_wallclock(RunSpec* run) {
+void read_boot_wallclock(RunFolder* run) {
     int fd = open((run->path + "properties").c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK);
     if (fd < 0) return;
     struct stat st;
@@ -102,7 +102,7 @@ void read_boot_wallclock(RunSpec* run) {
     }
 }
 
-void warn_missing_generations(const RunSpec& run, const char* type, const bool present[kGenerations + 1]) {
+void warn_missing_generations(const RunFolder& run, const char* type, const bool present[kGenerations + 1]) {
     // A generation missing below an older one that is there was lost.
     int oldest = -1;
     for (int g = kGenerations; g >= 0 && oldest < 0; g--)
@@ -164,8 +164,8 @@ int held_rank(const std::string& suffix) {
     return 2;  // an unknown boot: among the earlier boots
 }
 
-bool scan_run(const std::string& path, RunSpec* run) {
-    *run = RunSpec();
+bool scan_run(const std::string& path, RunFolder* run) {
+    *run = RunFolder();
     run->path = path.empty() || path.back() == '/' ? path : path + "/";
     std::string trimmed = run->path.substr(0, run->path.size() - 1);
     run->name = trimmed.substr(trimmed.rfind('/') == std::string::npos ? 0 : trimmed.rfind('/') + 1);
@@ -190,8 +190,8 @@ bool scan_run(const std::string& path, RunSpec* run) {
     }
     read_boot_wallclock(run);
 
-    SectionSpec current;
-    std::map<std::string, SectionSpec> held;
+    SectionFiles current;
+    std::map<std::string, SectionFiles> held;
     for (const LogType& type : kLogTypes) {
         const std::string base = type.name;
         bool present[kGenerations + 1] = {};
@@ -211,14 +211,14 @@ bool scan_run(const std::string& path, RunSpec* run) {
                 if (g <= kGenerations) present[g] = true;
                 gens.push_back({g, name});
             } else {
-                SectionSpec& s = held[suffix];
+                SectionFiles& s = held[suffix];
                 s.name = suffix;
                 s.same_boot = same_boot_suffix(suffix);
-                s.lanes.push_back(LaneSpec{type.source, "", {Piece{run->path + name, name}}});
+                s.lanes.push_back(LaneFiles{type.source, "", {Piece{run->path + name, name}}});
             }
         }
         std::sort(gens.begin(), gens.end(), [](auto& a, auto& b) { return a.first > b.first; });
-        LaneSpec lane{type.source, run->path + base, {}};
+        LaneFiles lane{type.source, run->path + base, {}};
         for (auto& g : gens) lane.pieces.push_back(Piece{run->path + g.second, g.second});
         warn_missing_generations(*run, type.name, present);
         current.lanes.push_back(lane);

@@ -27,31 +27,31 @@ struct Piece {
     std::string name;  // within the run folder, as shown
 };
 
-struct LaneSpec {
+struct LaneFiles {
     Source source;
     std::string base_path;      // the current file of the run's lane ("" for held pieces)
     std::vector<Piece> pieces;  // oldest first
 };
 
-struct SectionSpec {
+struct SectionFiles {
     int boot = 0;          // 0 the run, -1 the held boot before it, ...
     std::string name;      // the held suffix ("boot", "hbr", ...), "" for the run
     bool same_boot = true;  // the run's boot (its kernel times map to the recorded start)
-    std::vector<LaneSpec> lanes;
+    std::vector<LaneFiles> lanes;
 };
 
-struct RunSpec {
+struct RunFolder {
     std::string path;  // the folder, with a trailing '/'
     std::string name;  // its last component
     bool has_date = false;
     int64_t folder_days = 0;  // the date in its name, as days since the epoch
     bool has_boot_wallclock = false;
     int64_t boot_wallclock_ns = 0;
-    std::vector<SectionSpec> sections;  // held sections unordered; the run last
+    std::vector<SectionFiles> sections;  // held sections unordered; the run last
 };
 
 // Reads the folder's listing and properties; false (warned) when it cannot be listed.
-bool scan_run(const std::string& path, RunSpec* run);
+bool scan_run(const std::string& path, RunFolder* run);
 // The run folders the paths name (a run folder, or a folder of them such as
 // qrvlog/tavlolog/), in the order of the time in their names.
 std::vector<std::string> find_runs(const std::vector<std::string>& paths);

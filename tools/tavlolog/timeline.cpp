@@ -18,7 +18,7 @@ constexpr int kProbeEntries = 2000;  // looked at to find where a held boot begi
 
 using Lanes = std::vector<std::unique_ptr<Lane>>;
 
-LaneContext context_for(const RunSpec& run, const SectionSpec& section) {
+LaneContext context_for(const RunFolder& run, const SectionFiles& section) {
     LaneContext c;
     c.run_name = run.name;
     c.run_path = run.path;
@@ -32,11 +32,11 @@ LaneContext context_for(const RunSpec& run, const SectionSpec& section) {
 }
 
 // The first own instant of a section's lines, INT64_MAX when none has one.
-int64_t first_instant(const RunSpec& run, const SectionSpec& section) {
+int64_t first_instant(const RunFolder& run, const SectionFiles& section) {
     LaneContext context = context_for(run, section);
     int64_t first = INT64_MAX;
-    for (const LaneSpec& spec : section.lanes) {
-        Lane lane(spec, &context);
+    for (const LaneFiles& files : section.lanes) {
+        Lane lane(files, &context);
         if (lane.untimed()) continue;
         for (int i = 0; i < kProbeEntries && lane.next(); i++) {
             const Entry& e = lane.entry();
@@ -51,8 +51,8 @@ int64_t first_instant(const RunSpec& run, const SectionSpec& section) {
 
 // Held boots oldest first (by their first instant; boots without one by their
 // kind), numbered back from the run: the last held boot is -1.
-void order_sections(RunSpec* run) {
-    std::vector<SectionSpec>& s = run->sections;
+void order_sections(RunFolder* run) {
+    std::vector<SectionFiles>& s = run->sections;
     size_t held = s.size() - 1;
     std::vector<std::pair<int64_t, int>> keys(held);
     for (size_t i = 0; i < held; i++) keys[i] = {first_instant(*run, s[i]), held_rank(s[i].name)};
@@ -64,7 +64,7 @@ void order_sections(RunSpec* run) {
         if (ta != tb) return tb;  // a boot that tells no time: before those that do
         return keys[a].second < keys[b].second;
     });
-    std::vector<SectionSpec> sorted;
+    std::vector<SectionFiles> sorted;
     for (size_t i : order) sorted.push_back(s[i]);
     sorted.push_back(s.back());
     for (size_t i = 0; i < held; i++) sorted[i].boot = static_cast<int>(i) - static_cast<int>(held);
@@ -121,12 +121,12 @@ class Merger {
 };
 
 // The section's lanes in the order of the run's files.
-void open_lanes(const SectionSpec& section, const LaneContext* context, Lanes* lanes) {
-    std::vector<const LaneSpec*> specs;
-    for (const LaneSpec& spec : section.lanes) specs.push_back(&spec);
-    std::stable_sort(specs.begin(), specs.end(),
-                     [](const LaneSpec* a, const LaneSpec* b) { return a->source < b->source; });
-    for (const LaneSpec* spec : specs) lanes->push_back(std::unique_ptr<Lane>(new Lane(*spec, context)));
+void open_lanes(const SectionFiles& section, const LaneContext* context, Lanes* lanes) {
+    std::vector<const LaneFiles*> lane_files;
+    for (const LaneFiles& files : section.lanes) lane_files.push_back(&files);
+    std::stable_sort(lane_files.begin(), lane_files.end(),
+                     [](const LaneFiles* a, const LaneFiles* b) { return a->source < b->source; });
+    for (const LaneFiles* files : lane_files) lanes->push_back(std::unique_ptr<Lane>(new Lane(*files, context)));
 }
 
 std::string parent_of(const std::string& run_path) {
@@ -138,14 +138,14 @@ std::string parent_of(const std::string& run_path) {
 // Reads one run; when following, its run section stays open in `live`.
 void read_run(const std::string& path, const Filter& filter, Merger* merger, bool follow,
               Lanes* live, std::unique_ptr<LaneContext>* live_context) {
-    RunSpec run;
+    RunFolder run;
     if (!scan_run(path, &run)) return;
     order_sections(&run);
-    for (const SectionSpec& section : run.sections) {
+    for (const SectionFiles& section : run.sections) {
         if (!filter.boot_wanted(section.boot, section.name)) continue;
         std::unique_ptr<LaneContext> context(new LaneContext(context_for(run, section)));
         bool kernel_lines = false;
-        for (const LaneSpec& l : section.lanes) kernel_lines |= l.source == SRC_KERNEL && !l.pieces.empty();
+        for (const LaneFiles& l : section.lanes) kernel_lines |= l.source == SRC_KERNEL && !l.pieces.empty();
         if (kernel_lines && !context->has_boot_wallclock) {
             std::string which = section.name.empty() ? "" : " of the held boot \"" + section.name + "\"";
             warn("%s: kernel lines%s are shown after the others, with their time since boot: %s", run.path.c_str(),
