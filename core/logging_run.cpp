@@ -155,6 +155,20 @@ int calc_rotate_size(LogController* controller, int megabytes) {
     return kb > INT_MAX ? INT_MAX : static_cast<int>(kb);
 }
 
+// The kernel stamps its lines with its clock since boot, which stops while the
+// phone sleeps as CLOCK_MONOTONIC does; taken again at each run start and
+// folder switch, the value follows a changed wall clock or a sleep from then on.
+static void publish_boot_wallclock() {
+    struct timespec real, boot;
+    clock_gettime(CLOCK_REALTIME, &real);
+    clock_gettime(CLOCK_MONOTONIC, &boot);
+    int64_t ns = (static_cast<int64_t>(real.tv_sec) - boot.tv_sec) * 1000000000 + (real.tv_nsec - boot.tv_nsec);
+    char value[32];
+    snprintf(value, sizeof(value), "%lld.%09lld", static_cast<long long>(ns / 1000000000),
+             static_cast<long long>(ns % 1000000000));
+    property_set(PROP_BOOT_WALLCLOCK, value);
+}
+
 static void set_logsize_property(int rotate_kb) {
     char value[10];
     snprintf(value, sizeof(value), "%d", rotate_kb);
@@ -234,6 +248,7 @@ void start_logging(LogController* controller) {
     sigaction(SIGCHLD, &sa, nullptr);
 
     if (controller->boot_mode == 0) oru_mode_on();
+    publish_boot_wallclock();
     set_logsize_property(controller->rotate_size_kb);
     property_set(PROP_RUNNING, "1");
     controller->run_active = true;
@@ -388,6 +403,7 @@ void publish_run_folder(LogController* controller, const char* path) {
 
 void switch_run_folder(LogController* controller, const char* path) {
     publish_run_folder(controller, path);
+    publish_boot_wallclock();
     set_logsize_property(controller->rotate_size_kb);
     change_log_folder(path, controller->rotate_size_kb);
     sleep(1);
