@@ -38,6 +38,8 @@
 #include "core/log_controller.h"
 #include "core/logging_run.h"
 #include "platform/logger_write.h"
+#include "record/record.h"
+#include "storage/history_log.h"
 #include "transist/transist.h"
 #include "transist/transist_state.h"
 
@@ -418,6 +420,7 @@ double idle_wakeups(int seconds, std::string* detail) {
 }  // namespace
 
 int main(int argc, char** argv) {
+    record_set_history_sink(history_vlog);  // as the daemon records
     int n = argc > 1 ? atoi(argv[1]) : 200000;
     int idle_s = argc > 2 ? atoi(argv[2]) : 10;
     if (n < 2 || idle_s < 1) {

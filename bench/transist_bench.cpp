@@ -38,10 +38,12 @@
 #include <thread>
 #include <vector>
 
-#include "common/io_util.h"
 #include "collectors/kmsg_cat.h"
+#include "common/io_util.h"
 #include "core/log_controller.h"
 #include "core/logging_run.h"
+#include "record/record.h"
+#include "storage/history_log.h"
 #include "transist/transist.h"
 
 namespace {
@@ -362,6 +364,7 @@ extern "C" int renameat(int from_dir, const char* from, int to_dir, const char* 
 }
 
 int main(int argc, char** argv) {
+    record_set_history_sink(history_vlog);  // as the daemon records
     long total_mb = argc > 1 ? atol(argv[1]) : 100;
     int rotate_kb = argc > 2 ? atoi(argv[2]) : 2457;
     size_t send_size = argc > 3 ? static_cast<size_t>(atol(argv[3])) : 4096;

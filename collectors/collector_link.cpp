@@ -16,8 +16,7 @@
 #include "collectors/control_block.h"
 #include "common/io_util.h"
 #include "common/log_types.h"
-#include "common/wlog.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 #include "transist/transist.h"
 
 CollectorLink* volatile current_collector = nullptr;
@@ -44,7 +43,7 @@ constexpr long SEM_WAIT_LIMIT_NS = 500L * 1000 * 1000;
 
 #define COLLECTOR_HLOG(kind, prio, fmt, ...)                                  \
     do {                                                                      \
-        history_log(2, fmt, ##__VA_ARGS__);                                   \
+        record_history(2, fmt, ##__VA_ARGS__);                                \
         COLLECTOR_WLOG(kind, prio, fmt, ##__VA_ARGS__);                       \
     } while (0)
 

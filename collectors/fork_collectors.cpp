@@ -7,13 +7,13 @@
 #include <string.h>
 #include <unistd.h>
 
-#include "collectors/collector_link.h"
 #include "collectors/bt_cat.h"
+#include "collectors/collector_link.h"
 #include "collectors/kmsg_cat.h"
 #include "collectors/log_cat.h"
 #include "common/log_types.h"
-#include "common/wlog.h"
 #include "core/log_controller.h"
+#include "record/record.h"
 #include "storage/history_log.h"
 #include "transist/transist.h"
 

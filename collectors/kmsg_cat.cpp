@@ -11,8 +11,7 @@
 
 #include "collectors/control_block.h"
 #include "common/io_util.h"
-#include "common/wlog.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 
 const char* KmsgCat::kmsg_path = "/proc/kmsg";
 

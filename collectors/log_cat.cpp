@@ -18,8 +18,7 @@
 #include "collectors/control_block.h"
 #include "common/io_util.h"
 #include "common/limits.h"
-#include "common/wlog.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 
 const char* LogCat::device_root = "/dev/log/";
 

@@ -3,10 +3,9 @@
 #include <string.h>
 
 #include "common/io_util.h"
-#include "common/wlog.h"
 #include "config/config_store.h"
 #include "platform/properties.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 
 namespace {
 

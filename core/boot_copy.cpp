@@ -9,13 +9,13 @@
 #include <time.h>
 #include <unistd.h>
 
+#include "common/clock.h"
 #include "common/io_util.h"
 #include "common/limits.h"
 #include "common/unique_fd.h"
-#include "common/wlog.h"
 #include "core/log_controller.h"
 #include "core/logging_run.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 #include "storage/log_copy.h"
 #include "storage/safe_file.h"
 
@@ -34,12 +34,6 @@ bool exists(const char* path) {
 void remove_if_empty(const char* parent, const char* name) {
     UniqueFd dir(safe_open_dir("/data", parent, false, 0));
     if (dir.ok()) safe_remove_dir(dir.get(), name);
-}
-
-long long monotonic_us() {
-    struct timespec ts;
-    clock_gettime(CLOCK_MONOTONIC, &ts);
-    return static_cast<long long>(ts.tv_sec) * 1000000 + ts.tv_nsec / 1000;
 }
 
 // The folders of the other boots, oldest boot first: their logs are appended

@@ -5,8 +5,7 @@
 #include <unistd.h>
 
 #include "common/io_util.h"
-#include "common/wlog.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 
 int read_boot_mode(const char* path) {
     int fd = RETRY_EINTR(open(path, O_RDONLY | O_CLOEXEC));

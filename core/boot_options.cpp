@@ -5,10 +5,9 @@
 #include <string.h>
 
 #include "common/io_util.h"
-#include "common/wlog.h"
 #include "config/config_store.h"
 #include "core/log_controller.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 
 int logsize_from(const char* value) {
     // A number and nothing else (a stored value may end in "\r" or a tab).

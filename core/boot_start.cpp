@@ -11,14 +11,13 @@
 #include "common/io_util.h"
 #include "common/limits.h"
 #include "common/unique_fd.h"
-#include "common/wlog.h"
 #include "config/config_store.h"
 #include "core/boot_copy.h"
 #include "core/control_socket.h"
 #include "core/log_controller.h"
 #include "core/logging_run.h"
 #include "platform/properties.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 #include "storage/safe_file.h"
 #include "storage/storage_check.h"
 
@@ -191,7 +190,7 @@ int start_in_temp_folder(LogController* controller) {
 
 void boot_start(LogController* controller, int boot_mode) {
     controller->boot_mode = boot_mode;
-    history_log(0, "boot mode: %d", boot_mode);
+    record_history(0, "boot mode: %d", boot_mode);
     WLOG(TAG_MAIN, WLOG_INFO, "boot mode: %d", boot_mode);
     {
         ConfigCache config;

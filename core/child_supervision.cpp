@@ -8,11 +8,10 @@
 #include <unistd.h>
 
 #include "collectors/control_block.h"
-#include "common/wlog.h"
 #include "core/control_socket.h"
 #include "core/log_controller.h"
 #include "core/logging_run.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 #include "storage/storage_check.h"
 
 // May run on any thread, in the middle of anything: only the eventfd write,

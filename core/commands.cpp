@@ -8,7 +8,6 @@
 
 #include "common/control_protocol.h"
 #include "common/io_util.h"
-#include "common/wlog.h"
 #include "config/config_store.h"
 #include "config/log_path.h"
 #include "core/boot_copy.h"
@@ -17,8 +16,8 @@
 #include "core/log_controller.h"
 #include "core/logging_run.h"
 #include "platform/properties.h"
+#include "record/record.h"
 #include "storage/debug_dump.h"
-#include "storage/history_log.h"
 
 // Size in MB of the run that carries logging through a fast power-off.
 static constexpr int HBR_LOG_MB = 60;

@@ -17,16 +17,16 @@
 
 #include <cutils/sockets.h>
 
+#include "common/clock.h"
 #include "common/control_protocol.h"
 #include "common/io_util.h"
-#include "common/wlog.h"
 #include "core/boot_copy.h"
 #include "core/child_supervision.h"
 #include "core/client_table.h"
 #include "core/log_controller.h"
 #include "core/logging_run.h"
 #include "core/peer_auth.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 #include "storage/storage_check.h"
 
 time_t boot_copy_timeout_s = BOOT_COPY_TIMEOUT_S;
@@ -178,12 +178,6 @@ static unsigned long long read_counter(int fd) {
     return value;
 }
 
-static long long now_ms() {
-    struct timespec ts;
-    clock_gettime(CLOCK_MONOTONIC, &ts);
-    return static_cast<long long>(ts.tv_sec) * 1000 + ts.tv_nsec / 1000000;
-}
-
 static void keep_earliest(long long* wait_ms, long long ms) {
     if (ms < 0) ms = 0;
     if (*wait_ms < 0 || ms < *wait_ms) *wait_ms = ms;
@@ -197,14 +191,14 @@ static void watch(fd_set* set, int fd, int* max_fd) {
 void control_loop(LogController* controller) {
     // The time-out counts from the start of the loop: any event disarms it,
     // so until then all the time was spent waiting.
-    const long long boot_copy_deadline = now_ms() + static_cast<long long>(boot_copy_timeout_s) * 1000;
-    long long next_bind_try = now_ms() + CONTROL_RETRY_MS;
+    const long long boot_copy_deadline = monotonic_ms() + static_cast<long long>(boot_copy_timeout_s) * 1000;
+    long long next_bind_try = monotonic_ms() + CONTROL_RETRY_MS;
     int bind_retries = 0;
 
     for (;;) {
-        if (controller->listen_fd < 0 && now_ms() >= next_bind_try) {
+        if (controller->listen_fd < 0 && monotonic_ms() >= next_bind_try) {
             retry_control_socket(controller, &bind_retries);
-            next_bind_try = now_ms() + CONTROL_RETRY_MS;
+            next_bind_try = monotonic_ms() + CONTROL_RETRY_MS;
         }
         fd_set readable;
         FD_ZERO(&readable);
@@ -218,8 +212,8 @@ void control_loop(LogController* controller) {
         }
 
         long long wait_ms = -1;
-        if (controller->boot_copy_timer) keep_earliest(&wait_ms, boot_copy_deadline - now_ms());
-        if (controller->listen_fd < 0) keep_earliest(&wait_ms, next_bind_try - now_ms());
+        if (controller->boot_copy_timer) keep_earliest(&wait_ms, boot_copy_deadline - monotonic_ms());
+        if (controller->listen_fd < 0) keep_earliest(&wait_ms, next_bind_try - monotonic_ms());
         int flush_ms = peer_records_flush();
         if (flush_ms >= 0) keep_earliest(&wait_ms, flush_ms);
         struct timeval timeout = {static_cast<time_t>(wait_ms / 1000),
@@ -236,7 +230,7 @@ void control_loop(LogController* controller) {
         }
         if (ready == 0) {
             // Other waits (a retry, a record summary) end here too.
-            if (!controller->boot_copy_timer || now_ms() < boot_copy_deadline) continue;
+            if (!controller->boot_copy_timer || monotonic_ms() < boot_copy_deadline) continue;
             HLOG(TAG_MAIN, WLOG_ERROR, "select() timeout");
             controller->boot_copy_timer = 0;
             if (boot_fail_copy(controller) < 0) {

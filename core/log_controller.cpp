@@ -5,9 +5,8 @@
 #include <string.h>
 #include <sys/eventfd.h>
 
-#include "common/wlog.h"
 #include "platform/properties.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 
 int efd_chld = -1;
 int efd_thread = -1;

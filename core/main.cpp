@@ -4,17 +4,20 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include "common/wlog.h"
 #include "core/boot_mode.h"
 #include "core/boot_start.h"
 #include "core/log_controller.h"
 #include "core/privileges.h"
 #include "platform/properties.h"
+#include "record/record.h"
 #include "storage/history_log.h"
 
 int main() {
     // A client or collector that has gone must give EPIPE, not end the daemon.
     signal(SIGPIPE, SIG_IGN);
+    // From here on every record also reaches the history, in this process and
+    // in every collector it forks.
+    record_set_history_sink(history_vlog);
     // A daemon restarted after a death finds its predecessor's run in these:
     // before anything reads them, no run is live and no run folder may receive
     // this daemon's records.
@@ -27,7 +30,7 @@ int main() {
         drop_privileges();
     }
 
-    history_log(0, "****** TQLOG START *******");
+    record_history(0, "****** TQLOG START *******");
     WLOG(TAG_DEBUG, WLOG_INFO, "****** TQLOG START *******");
 
     // Every file and folder gets exactly the mode it is created with.

@@ -9,7 +9,7 @@
 #include "common/control_protocol.h"
 #include "common/io_util.h"
 #include "common/unique_fd.h"
-#include "storage/record_limit.h"
+#include "record/record_limit.h"
 
 RecordLimit refused_control_peers = RECORD_LIMIT(TAG_MAIN, "refused control clients");
 static RecordLimit refused_log_peers = RECORD_LIMIT(TAG_TRANSIST, "refused log_socket clients");

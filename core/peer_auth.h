@@ -3,7 +3,7 @@
 
 #include <sys/types.h>
 
-#include "storage/record_limit.h"
+#include "record/record_limit.h"
 
 // Records of refused control clients: any app can connect in a loop.
 extern RecordLimit refused_control_peers;

@@ -4,7 +4,7 @@
 // and collector processes) whole without any lock, and no lock means nothing
 // a fork could leave held. The time is computed by hand for the same reason:
 // glibc's localtime_r and gmtime_r take a process-wide lock.
-#include "common/wlog.h"
+#include "platform/wlog.h"
 
 #include <atomic>
 #include <errno.h>

@@ -10,10 +10,9 @@
 
 #include "common/io_util.h"
 #include "common/unique_fd.h"
-#include "common/wlog.h"
 #include "platform/kernel_files.h"
 #include "platform/properties.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 #include "storage/safe_file.h"
 
 namespace {

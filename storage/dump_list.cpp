@@ -9,10 +9,9 @@
 
 #include "common/io_util.h"
 #include "common/unique_fd.h"
-#include "common/wlog.h"
 #include "platform/kernel_files.h"
+#include "record/record.h"
 #include "storage/debug_dump.h"
-#include "storage/history_log.h"
 
 namespace {
 

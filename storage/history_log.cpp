@@ -3,7 +3,6 @@
 #include <atomic>
 #include <errno.h>
 #include <fcntl.h>
-#include <libgen.h>
 #include <pthread.h>
 #include <stdarg.h>
 #include <stdio.h>
@@ -17,8 +16,8 @@
 #include "common/io_util.h"
 #include "common/limits.h"
 #include "common/unique_fd.h"
-#include "common/wlog.h"
 #include "platform/properties.h"
+#include "record/record.h"
 #include "storage/safe_file.h"
 
 namespace {
@@ -140,6 +139,13 @@ void history_log_after_fork() {
 }
 
 void history_log(int level, const char* format, ...) {
+    va_list args;
+    va_start(args, format);
+    history_vlog(level, format, args);
+    va_end(args);
+}
+
+void history_vlog(int level, const char* format, va_list args) {
     if (level < 0 || level > 2) return;
     if (holding_history_lock) return;
 
@@ -147,10 +153,7 @@ void history_log(int level, const char* format, ...) {
     format_stamp(stamp, sizeof(stamp));
 
     char message[RECORD_LEN + 1];
-    va_list args;
-    va_start(args, format);
     if (vsnprintf(message, sizeof(message), format, args) < 0) message[0] = '\0';
-    va_end(args);
     make_printable(message);
 
     // The line keeps room for its newline so each file gets it in one write.
@@ -209,25 +212,4 @@ char* get_run_folder(char* out) {
     if (folder[0] == '\0') return nullptr;
     memcpy(out, folder, strlen(folder) + 1);
     return out;
-}
-
-int make_dir_recursive(const char* path) {
-    WLOG(TAG_UTIL, WLOG_INFO, "create dir %s", path);
-
-    char buf[RECORD_LEN + 1];
-    int ok = copy_str(buf, sizeof(buf), path);
-    if (ok) {
-        char parent[RECORD_LEN + 1];
-        copy_str(parent, sizeof(parent), dirname(buf));
-        // A failure of the parent shows in the mkdir below.
-        if (access(parent, F_OK) != 0) make_dir_recursive(parent);
-        if (mkdir(path, 0775) == 0) return 1;
-    } else {
-        // A cut path would create some other directory.
-        errno = ENAMETOOLONG;
-    }
-    int err = errno;
-    HLOG(TAG_UTIL, WLOG_ERROR, "mkdir fail(%s)", strerror(err));
-    errno = err;
-    return 0;
 }

@@ -3,6 +3,7 @@
 #include <dirent.h>
 #include <errno.h>
 #include <fcntl.h>
+#include <libgen.h>
 #include <limits.h>
 #include <stdio.h>
 #include <string.h>
@@ -12,9 +13,8 @@
 #include "common/io_util.h"
 #include "common/limits.h"
 #include "common/unique_fd.h"
-#include "common/wlog.h"
-#include "storage/history_log.h"
-#include "storage/record_limit.h"
+#include "record/record.h"
+#include "record/record_limit.h"
 
 namespace {
 
@@ -427,3 +427,27 @@ int safe_remove_file(int dirfd, const char* name) { return unlinkat(dirfd, name,
 int safe_remove_dir(int dirfd, const char* name) { return unlinkat(dirfd, name, AT_REMOVEDIR); }
 
 int safe_remove_tree(int dirfd, const char* name) { return remove_tree(dirfd, name, 0); }
+
+// Paths up to 254 characters, as the history cuts its lines.
+static constexpr size_t MAKE_DIR_BUF = 255;
+
+int make_dir_recursive(const char* path) {
+    WLOG(TAG_UTIL, WLOG_INFO, "create dir %s", path);
+
+    char buf[MAKE_DIR_BUF];
+    int ok = copy_str(buf, sizeof(buf), path);
+    if (ok) {
+        char parent[MAKE_DIR_BUF];
+        copy_str(parent, sizeof(parent), dirname(buf));
+        // A failure of the parent shows in the mkdir below.
+        if (access(parent, F_OK) != 0) make_dir_recursive(parent);
+        if (mkdir(path, 0775) == 0) return 1;
+    } else {
+        // A cut path would create some other directory.
+        errno = ENAMETOOLONG;
+    }
+    int err = errno;
+    HLOG(TAG_UTIL, WLOG_ERROR, "mkdir fail(%s)", strerror(err));
+    errno = err;
+    return 0;
+}

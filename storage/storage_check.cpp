@@ -4,9 +4,8 @@
 #include <sys/statfs.h>
 
 #include "common/io_util.h"
-#include "common/wlog.h"
 #include "platform/properties.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 
 uint64_t get_free_space(const char* path, int retries) {
     while (retries >= 0) {

@@ -14,9 +14,8 @@
 #include <cutils/sockets.h>
 
 #include "common/io_util.h"
-#include "common/wlog.h"
 #include "platform/properties.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 #include "transist/log_files.h"
 #include "transist/transist_queue.h"
 #include "transist/transist_state.h"
@@ -45,12 +44,6 @@ static bool reader_done = false;    // wake_lock
 
 // The longest period the writer's microsecond arithmetic was designed for.
 static const int MAX_INTERVAL = 2147;
-
-int64_t monotonic_us() {
-    timespec ts;
-    clock_gettime(CLOCK_MONOTONIC, &ts);
-    return static_cast<int64_t>(ts.tv_sec) * 1000000 + ts.tv_nsec / 1000;
-}
 
 static void init_wake_once() {
     static pthread_once_t once = PTHREAD_ONCE_INIT;
@@ -187,7 +180,7 @@ static void read_parameters() {
     transist_interval = choose_interval(value);
     long capacity = transist_capacity, throughput = transist_throughput,
          interval = transist_interval;
-    history_log(1, "buffer:%ldB; throughput:%ldMB/s; interval: %lds", capacity, throughput,
+    record_history(1, "buffer:%ldB; throughput:%ldMB/s; interval: %lds", capacity, throughput,
                 interval);
     WLOG(TAG_TRANSIST, WLOG_INFO, "buffer:%ldB; throughput:%ldMB/s; interval: %lds", capacity,
          throughput, interval);

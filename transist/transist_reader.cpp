@@ -10,9 +10,8 @@
 #include <unistd.h>
 
 #include "common/io_util.h"
-#include "common/wlog.h"
 #include "core/peer_auth.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 #include "transist/transist.h"
 #include "transist/transist_queue.h"
 #include "transist/transist_reader.h"

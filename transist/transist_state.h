@@ -8,6 +8,8 @@
 
 #include <atomic>
 
+#include "common/clock.h"
+
 class LogController;
 
 // Guards log_files. Taken before queue_lock, never after it.

@@ -9,10 +9,9 @@
 #include <unistd.h>
 
 #include "common/io_util.h"
-#include "common/wlog.h"
 #include "core/control_socket.h"
 #include "core/log_controller.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 #include "storage/storage_check.h"
 #include "transist/log_files.h"
 #include "transist/transist.h"
