@@ -15,6 +15,9 @@
 #include "record/record.h"
 #include "storage/safe_file.h"
 
+// The resolved logpath is kept in a configuration field.
+static_assert(LOG_PATH_VALUE_MAX == CONFIG_FIELD_LEN, "a logpath value is a configuration value");
+
 namespace {
 
 // A line of a configuration file is read in pieces of at most this many
@@ -163,6 +166,18 @@ int config_read_file(ConfigCache* cache, const char* path) {
 
 int config_read_system_defaults(ConfigCache* cache) {
     return config_read_file(cache, SYSTEM_DEFAULTS_FILE);
+}
+
+// Replaces the stored logpath with persist.qrvlog.log2sd.path when that is set
+// and differs; rewrites the configuration file then.
+static void apply_log_path_override(ConfigCache* cache) {
+    char override_path[PROPERTY_VALUE_MAX];
+    property_get("persist.qrvlog.log2sd.path", override_path, "");
+    if (override_path[0] == '\0') return;
+    // config_update_item reports 0 when the value is already the stored one.
+    if (config_update_item(cache, "logpath", override_path) == 0) return;
+    WLOG(TAG_CONFIG, WLOG_DEBUG, "new log path is %s", override_path);
+    config_write(cache);
 }
 
 int config_load(ConfigCache* cache) {
