@@ -37,9 +37,11 @@
 #include "collectors/log_cat.h"
 #include "core/log_controller.h"
 #include "core/logging_run.h"
+#include "core/run_host.h"
 #include "platform/logger_write.h"
 #include "record/record.h"
 #include "storage/history_log.h"
+#include "transist/log_files.h"
 #include "transist/transist.h"
 #include "transist/transist_state.h"
 
@@ -276,7 +278,7 @@ Engine engine_from_memory(int n) {
     android_log_format_free(format);
 
     LogController* controller = bench_controller(RUN_D, true, false, false);
-    transist_create(controller, RUN_D, NO_ROTATION_KB);
+    transist_create(run_host(controller), {RUN_D, "", {true, true, true, false, false}, NO_ROTATION_KB});
     double cpu0 = self_cpu_s();
     t0 = now_s();
     pid_t pid = fork();

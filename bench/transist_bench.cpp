@@ -42,6 +42,7 @@
 #include "common/io_util.h"
 #include "core/log_controller.h"
 #include "core/logging_run.h"
+#include "core/run_host.h"
 #include "record/record.h"
 #include "storage/history_log.h"
 #include "transist/transist.h"
@@ -177,7 +178,7 @@ Result bench_transist(long per_stream, int rotate_kb, size_t send_size) {
     LogController* controller = new LogController();  // lives as long as the process
     controller->android_log = controller->kernel_log = controller->bt_log = 1;
     controller->log_path_state = 0;  // a run in /data
-    transist_create(controller, RUN_A, rotate_kb);
+    transist_create(run_host(controller), {RUN_A, "", {true, true, true, true, true}, rotate_kb});
 
     int go[2];
     if (pipe(go) != 0) {

@@ -17,7 +17,6 @@
 #include "common/io_util.h"
 #include "common/log_types.h"
 #include "record/record.h"
-#include "transist/transist.h"
 
 CollectorLink* volatile current_collector = nullptr;
 volatile sig_atomic_t stop_signalled = 0;

@@ -15,6 +15,7 @@
 #include "core/log_controller.h"
 #include "record/record.h"
 #include "storage/history_log.h"
+#include "transist/log_files.h"
 #include "transist/transist.h"
 
 static void close_if_open(int* fd) {

@@ -11,6 +11,7 @@
 #include "core/control_socket.h"
 #include "core/log_controller.h"
 #include "core/logging_run.h"
+#include "core/reply_client.h"
 #include "record/record.h"
 #include "storage/storage_check.h"
 

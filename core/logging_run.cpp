@@ -25,6 +25,7 @@
 #include "common/unique_fd.h"
 #include "core/child_supervision.h"
 #include "core/log_controller.h"
+#include "core/run_host.h"
 #include "platform/properties.h"
 #include "record/record.h"
 #include "storage/folder_records.h"
@@ -171,7 +172,11 @@ void start_logging(LogController* controller) {
     property_set(PROP_RUNNING, "1");
     controller->run_active = true;
 
-    transist_create(controller, controller->run_folder, controller->rotate_size_kb);
+    TransistRun run = {controller->run_folder, controller->logpath,
+                       {controller->android_log != 0, controller->android_log != 0,
+                        controller->android_log != 0, controller->kernel_log != 0, controller->bt_log != 0},
+                       controller->rotate_size_kb};
+    transist_create(run_host(controller), run);
     create_control_block(controller);
 
     if (controller->android_log) {
@@ -316,7 +321,7 @@ void publish_run_folder(LogController* controller, const char* path) {
 void switch_run_folder(LogController* controller, const char* path) {
     publish_run_folder(controller, path);
     set_logsize_property(controller->rotate_size_kb);
-    change_log_folder(path, controller->rotate_size_kb);
+    change_log_folder(path, controller->logpath, controller->rotate_size_kb);
     sleep(1);
 }
 

@@ -1,10 +1,10 @@
-// Replies and broadcasts to control clients.
+#include "core/reply_client.h"
+
 #include <string.h>
 #include <unistd.h>
 
 #include <sys/socket.h>
 
-#include "core/control_socket.h"
 #include "core/log_controller.h"
 #include "record/record.h"
 

@@ -15,6 +15,7 @@
 #include "common/civil_time.h"
 #include "common/io_util.h"
 #include "common/limits.h"
+#include "common/text.h"
 #include "common/unique_fd.h"
 #include "platform/properties.h"
 #include "record/record.h"
@@ -95,19 +96,6 @@ void append_run_record(const char* folder, const char* line, size_t len) {
     UniqueFd fd(append_record(dir.get(), line, len));
 }
 
-// A record is one line: line breaks and other control bytes in a message
-// (a client's command text, a damaged configuration line) would forge or
-// garble lines, so they are shown as '?'. Tabs are harmless and stay.
-void make_printable(char* s) {
-    // A message that ends its line itself keeps its text whole.
-    size_t len = strlen(s);
-    if (len > 0 && s[len - 1] == '\n') s[len - 1] = '\0';
-    for (; *s != '\0'; s++) {
-        unsigned char c = static_cast<unsigned char>(*s);
-        if ((c < 0x20 && c != '\t') || c == 0x7f) *s = '?';
-    }
-}
-
 // Registered when the program loads, so every fork is covered, also those of
 // code that does not know about the history log: in the child the parent's
 // other threads are gone, and one of them may have held the lock.
@@ -154,7 +142,10 @@ void history_vlog(int level, const char* format, va_list args) {
 
     char message[RECORD_LEN + 1];
     if (vsnprintf(message, sizeof(message), format, args) < 0) message[0] = '\0';
-    make_printable(message);
+    // A record is one line: line breaks and other control bytes in a message
+    // (a client's command text, a damaged configuration line) would forge or
+    // garble lines. Tabs are harmless and stay.
+    printable_record(message);
 
     // The line keeps room for its newline so each file gets it in one write.
     char line[RECORD_LEN + 2];

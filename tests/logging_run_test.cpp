@@ -14,6 +14,7 @@
 #include "core/child_supervision.h"
 #include "core/log_controller.h"
 #include "test_util.h"
+#include "transist/log_files.h"
 #include "transist/transist.h"
 
 namespace {

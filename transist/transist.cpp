@@ -14,6 +14,7 @@
 #include <cutils/sockets.h>
 
 #include "common/io_util.h"
+#include "common/text.h"
 #include "platform/properties.h"
 #include "record/record.h"
 #include "transist/log_files.h"
@@ -21,17 +22,14 @@
 #include "transist/transist_state.h"
 
 std::atomic<bool> stop_requested{false};
-LogFile log_files[LOG_TYPE_COUNT];
 int transist_listen_fd = -1;
 pthread_t read_thread_id;
 pthread_t write_thread_id;
 
-pthread_mutex_t file_table_lock = PTHREAD_MUTEX_INITIALIZER;
-std::atomic<int> rotate_limit_kb{1024};
 int transist_capacity = DEFAULT_CAPACITY;
 int transist_interval = 1;
 int transist_throughput = 2;
-LogController* transist_controller = nullptr;
+TransistHost* transist_host = nullptr;
 std::atomic<bool> writer_running{false};
 bool reader_paused = false;
 int reader_wake_fd = -1;
@@ -114,15 +112,6 @@ void transist_wake() {
     pthread_mutex_lock(&wake_lock);
     pthread_cond_broadcast(&wake_cond);
     pthread_mutex_unlock(&wake_lock);
-}
-
-void printable_copy(char* dst, int n, const char* src) {
-    int i = 0;
-    for (; i < n - 1 && src[i] != '\0'; i++) {
-        unsigned char c = static_cast<unsigned char>(src[i]);
-        dst[i] = (c < 0x20 || c >= 0x7f) ? '?' : static_cast<char>(c);
-    }
-    dst[i] = '\0';
 }
 
 // A decimal number and nothing else (surrounding blanks allowed); false for
@@ -227,13 +216,13 @@ static void open_listen_socket() {
     transist_listen_fd = fd;
 }
 
-void transist_create(LogController* controller, const char* run_folder, int rotate_kb) {
+void transist_create(TransistHost* host, const TransistRun& run) {
     init_wake_once();
-    rotate_limit_kb = rotate_kb;
-    transist_controller = controller;
+    rotate_limit_kb = run.rotate_kb;
+    transist_host = host;
     read_parameters();
     discard_leftovers();
-    open_output_files(controller, run_folder);
+    open_output_files(run);
 
     if (reader_wake_fd < 0) reader_wake_fd = eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC);
     uint64_t stale;
