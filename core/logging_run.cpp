@@ -20,10 +20,10 @@
 
 #include "collectors/collector_link.h"
 #include "collectors/control_block.h"
-#include "collectors/fork_collectors.h"
 #include "common/io_util.h"
 #include "common/unique_fd.h"
 #include "core/child_supervision.h"
+#include "core/fork_collectors.h"
 #include "core/log_controller.h"
 #include "core/run_host.h"
 #include "platform/properties.h"

@@ -106,6 +106,21 @@ void wake_reader() {
     RETRY_EINTR(write(reader_wake_fd, &one, sizeof(one)));
 }
 
+static void close_if_open(int* fd) {
+    if (*fd > 0) close(*fd);
+    *fd = -1;
+}
+
+void transist_close_in_child() {
+    // The tables may be mid-update by the daemon's threads at the fork; the
+    // child only reads its own copy and owns no lock.
+    for (LogFile& file : log_files) {
+        close_if_open(&file.fd);
+        close_if_open(&file.sock);
+    }
+    close_if_open(&transist_listen_fd);
+}
+
 void transist_wake() {
     wake_reader();
     init_wake_once();

@@ -55,6 +55,10 @@ void transist_create(TransistHost* host, const TransistRun& run);
 // queued byte and syncs the files.
 void transist_wake();
 
+// In a freshly forked collector: closes the run's files, the collectors'
+// connections and "log_socket", which the child must not keep alive.
+void transist_close_in_child();
+
 // Reopens the open output files in new_folder (below trusted_root) and sets the
 // rotation limit.
 void change_log_folder(const char* new_folder, const char* trusted_root, int new_rotate_kb);

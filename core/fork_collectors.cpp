@@ -1,5 +1,5 @@
 // Fork wrappers: one collector process each.
-#include "collectors/fork_collectors.h"
+#include "core/fork_collectors.h"
 
 #include <errno.h>
 #include <signal.h>
@@ -15,7 +15,6 @@
 #include "core/log_controller.h"
 #include "record/record.h"
 #include "storage/history_log.h"
-#include "transist/log_files.h"
 #include "transist/transist.h"
 
 static void close_if_open(int* fd) {
@@ -32,13 +31,7 @@ static void collector_child_setup(LogController* controller) {
     history_log_after_fork();
     collector_daemon_pid = getppid();
 
-    // The tables may be mid-update by the daemon's threads at the fork; the
-    // child only reads its own copy and owns no lock.
-    for (LogFile& file : log_files) {
-        close_if_open(&file.fd);
-        close_if_open(&file.sock);
-    }
-    close_if_open(&transist_listen_fd);
+    transist_close_in_child();
     if (controller != nullptr) {
         close_if_open(&controller->listen_fd);
         for (ClientSlot& slot : controller->clients) close_if_open(&slot.fd);
