@@ -12,7 +12,7 @@
 #include <stddef.h>
 #include <string.h>
 
-// Abstract-namespace local socket (same text as core/control_socket.h).
+// Abstract-namespace local socket.
 #define CONTROL_SOCKET_NAME "tavlologd"
 constexpr int CONTROL_BACKLOG = 4;
 
@@ -66,6 +66,11 @@ constexpr int REPLY_SUFFIX_LEN = 2;
 constexpr const char* control_broadcasts[] = {BROADCAST_STOPPED, BROADCAST_STORAGE_FULL,
                                               BROADCAST_FOLDER_LOST};
 constexpr int CONTROL_BROADCAST_COUNT = sizeof(control_broadcasts) / sizeof(control_broadcasts[0]);
+
+// The daemon's run state as clients read it from system properties.
+#define PROP_RUNNING "debug.TQ.running"    // "1" while a logging run is active
+#define PROP_REALPATH "debug.TQ.realpath"  // the run folder, "" when none
+#define PROP_LOGSIZE "debug.TQ.logsize"    // the rotation size of the run in KB
 
 // Peers allowed on the control socket besides the daemon's own user.
 constexpr int CONTROL_UID_ROOT = 0;

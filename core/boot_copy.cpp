@@ -24,9 +24,11 @@ namespace {
 constexpr long long KELM_WAIT_US = 29999999;
 constexpr int KELM_RUN_MB = 300;
 
-bool exists(const char* path) {
-    struct stat st;
-    return lstat(path, &st) == 0;
+// What a copy of held logs needs of the controller, as it stands now.
+HeldCopy held_copy(LogController* controller) {
+    HeldCopy copy = {controller->logpath, {}, controller->data_storage_low != 0, &controller->warned};
+    for (int type = 0; type < LOG_TYPE_COUNT; type++) copy.enabled[type] = controller->log_on[type] != 0;
+    return copy;
 }
 
 // Removes the folder name of /data (or of parent below it) if it is empty: a
@@ -79,7 +81,7 @@ bool copy_other_modes(LogController* controller) {
     for (int i = 0; i < folders.count; i++) {
         char folder[PATH_LEN];
         snprintf(folder, sizeof(folder), "%s%s/", OTHER_MODE_FOLDER, folders.entries[i].name);
-        CopyResult rc = copy_log_folder(controller, folder, controller->run_folder, ".otherboot");
+        CopyResult rc = copy_log_folder(held_copy(controller), folder, controller->run_folder, ".otherboot");
         remove_if_empty(OTHER_MODE_FOLDER, folders.entries[i].name);
         if (rc == COPY_ABORT) return false;
     }
@@ -105,13 +107,13 @@ void copy_saved_logs(LogController* controller) {
         const char* suffix;
     } held[] = {{TEMP_FOLDER, "log_temp", ".boot"}, {HBR_FOLDER, "log_hbr", ".hbr"}};
     for (const auto& h : held) {
-        if (!exists(h.folder)) continue;
-        CopyResult rc = copy_log_folder(controller, h.folder, controller->run_folder, h.suffix);
+        if (!path_exists(h.folder)) continue;
+        CopyResult rc = copy_log_folder(held_copy(controller), h.folder, controller->run_folder, h.suffix);
         remove_if_empty("/data/", h.name);
         if (rc == COPY_ABORT) return;
         sleep(1);
     }
-    if (exists(OTHER_MODE_FOLDER)) copy_other_modes(controller);
+    if (path_exists(OTHER_MODE_FOLDER)) copy_other_modes(controller);
 }
 
 int boot_fail_copy(LogController* controller) {
@@ -130,7 +132,7 @@ int boot_fail_copy(LogController* controller) {
         HLOG(TAG_MAIN, WLOG_ERROR, "create %s failed", folder);
         return -1;
     }
-    CopyResult rc = copy_log_folder(controller, TEMP_FOLDER, controller->run_folder, ".boot");
+    CopyResult rc = copy_log_folder(held_copy(controller), TEMP_FOLDER, controller->run_folder, ".boot");
     WLOG(TAG_MAIN, WLOG_DEBUG, "Delete '%s'.", TEMP_FOLDER);
     remove_if_empty("/data/", "log_temp");
     // A card that failed during the copy is no complete copy.
@@ -169,8 +171,8 @@ void kelm_mode_copy(LogController* controller) {
         controller->rotate_size_kb = calc_rotate_size(controller, KELM_RUN_MB);
         switch_run_folder(controller, controller->run_folder);
         // On the card now: the writer checks the card's free space, not /data's.
-        controller->log_path_state = 1;
-        copy_log_folder(controller, held, controller->run_folder, ".kelm_boot");
+        controller->log_path_state = LOG_PATH_UNDER_LOGPATH;
+        copy_log_folder(held_copy(controller), held, controller->run_folder, ".kelm_boot");
         return;
     }
 }

@@ -28,11 +28,6 @@ constexpr int BOOT_RUN_MB = 60;
 constexpr int OTHER_BOOT_RUN_MB = BOOT_RUN_MB / 3;
 constexpr char KELM_LOG_PATH[] = "/data/ext_sdcard_tool";
 
-bool exists(const char* path) {
-    struct stat st;
-    return lstat(path, &st) == 0;
-}
-
 // The first boot seeds the configuration from the system image's defaults.
 void load_config(ConfigCache* config) {
     if (access(CONFIG_FILE, F_OK) == 0) {
@@ -45,8 +40,8 @@ void load_config(ConfigCache* config) {
 
 // The kelm and other boots record without the Bluetooth stack's log.
 void bluetooth_off(LogController* controller) {
-    if (!controller->bt_log) return;
-    controller->bt_log = 0;
+    if (!controller->log_on[LOG_BT]) return;
+    controller->log_on[LOG_BT] = 0;
     controller->log_file_num -= 5;
 }
 
@@ -67,15 +62,15 @@ void normal_boot(LogController* controller, ConfigCache* config) {
     }
     if (controller->sd_log_path) {
         if (!start_in_temp_folder(controller)) return;
-        if (data_storage_low == 1) {
+        if (controller->data_storage_low == 1) {
             HLOG(TAG_MAIN, WLOG_ERROR, "/data is low, dont start children process(2)");
-            controller->log_path_state = 1;
+            controller->log_path_state = LOG_PATH_UNDER_LOGPATH;
             return;
         }
     } else {
         compose_run_folder(controller);
         if (create_run_folder(controller, controller->logpath, controller->run_folder) < 0) return;
-        controller->log_path_state = 1;
+        controller->log_path_state = LOG_PATH_UNDER_LOGPATH;
     }
     start_boot_run(controller, BOOT_RUN_MB);
 }
@@ -86,7 +81,7 @@ void kelm_boot(LogController* controller, ConfigCache* config) {
     copy_str(controller->logpath, sizeof(controller->logpath), KELM_LOG_PATH);
     controller->boot_copy_timer = 0;
     if (!start_in_temp_folder(controller)) return;
-    if (data_storage_low == 1) {
+    if (controller->data_storage_low == 1) {
         HLOG(TAG_MAIN, WLOG_ERROR, "/data is low, dont start tqlog");
         return;
     }
@@ -113,7 +108,7 @@ int collect_boot_number(void* arg, const char* name, int) {
 // The number of this boot's folder: one past the highest of the earlier
 // boots, whose two newest folders are kept. -1 when they cannot be listed.
 int next_other_mode_number() {
-    if (!exists(OTHER_MODE_FOLDER)) return 1;
+    if (!path_exists(OTHER_MODE_FOLDER)) return 1;
     BootNumbers numbers;
     UniqueFd dir(safe_open_dir("/data", OTHER_MODE_FOLDER, false, 0));
     if (!dir.ok() || safe_list_dir(dir.get(), collect_boot_number, &numbers) < 0) {
@@ -158,22 +153,22 @@ void other_boot(LogController* controller, ConfigCache* config) {
 }  // namespace
 
 int start_in_temp_folder(LogController* controller) {
-    controller->log_path_state = 0;
+    controller->log_path_state = LOG_PATH_HELD_IN_DATA;
     if (controller->boot_mode == 0) controller->boot_copy_timer = 1;
     copy_str(controller->run_folder, sizeof(controller->run_folder), TEMP_FOLDER);
     WLOG(TAG_MAIN, WLOG_DEBUG, "save log to temp file %s", TEMP_FOLDER);
     if (is_storage_low("/data")) {
-        data_storage_low = 1;
+        controller->data_storage_low = 1;
         return 1;
     }
-    data_storage_low = 0;
+    controller->data_storage_low = 0;
     // What an earlier boot left there was not wanted on the card; what this
     // boot's earlier daemon held there is, and is appended to.
     char booted[PROPERTY_VALUE_MAX];
     property_get(PROP_BOOTED, booted, "0");
     if (strcmp(booted, "1") == 0) {
-        if (exists(TEMP_FOLDER)) HLOG(TAG_MAIN, WLOG_ERROR, "restarted within this boot, %s kept", TEMP_FOLDER);
-    } else if (exists(TEMP_FOLDER)) {
+        if (path_exists(TEMP_FOLDER)) HLOG(TAG_MAIN, WLOG_ERROR, "restarted within this boot, %s kept", TEMP_FOLDER);
+    } else if (path_exists(TEMP_FOLDER)) {
         UniqueFd data(safe_open_dir("/data", "/data", false, 0));
         if (!data.ok() || safe_remove_tree(data.get(), "log_temp") != 0) {
             int err = errno;

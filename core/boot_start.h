@@ -9,5 +9,5 @@ class LogController;
 void boot_start(LogController* controller, int boot_mode);
 
 // Points the run at /data/log_temp/ and prepares that folder; sets
-// data_storage_low. 0 when the folder cannot be made.
+// the controller's data_storage_low. 0 when the folder cannot be made.
 int start_in_temp_folder(LogController* controller);

@@ -105,7 +105,7 @@ static int cmd_deep_start(LogController* controller, int fd) {
     copy_saved_logs(controller);
     char autostart_on[] = "autostart=1";
     apply_config_message(controller, autostart_on);
-    controller->log_path_state = 1;
+    controller->log_path_state = LOG_PATH_UNDER_LOGPATH;
     return 1;
 }
 
@@ -146,7 +146,7 @@ static int move_run_to_log_path(LogController* controller, int fd) {
     }
     controller->rotate_size_kb = calc_rotate_size(controller, controller->logsize);
     switch_run_folder(controller, controller->run_folder);
-    controller->log_path_state = 1;
+    controller->log_path_state = LOG_PATH_UNDER_LOGPATH;
     reply_word(controller, fd, CMD_COPY, REPLY_DONE);
     copy_saved_logs(controller);
     dump_into_run_folder(controller);
@@ -155,7 +155,7 @@ static int move_run_to_log_path(LogController* controller, int fd) {
 
 static int cmd_copy(LogController* controller, int fd) {
     if (run_live(controller)) {
-        if (controller->log_path_state == 1) {
+        if (controller->log_path_state == LOG_PATH_UNDER_LOGPATH) {
             HLOG(TAG_MAIN, WLOG_ERROR, "has copyed to sd,ignore this 'copy'");
             reply_word(controller, fd, CMD_COPY, REPLY_DONE);
             return 1;
@@ -198,7 +198,7 @@ static int cmd_hbr_shutdown(LogController* controller, int fd) {
         reply_word(controller, fd, CMD_HBR_SHUTDOWN, REPLY_FAILED);
         return 0;
     }
-    controller->log_path_state = 0;
+    controller->log_path_state = LOG_PATH_HELD_IN_DATA;
     controller->rotate_size_kb = calc_rotate_size(controller, HBR_LOG_MB);
     switch_run_folder(controller, HBR_FOLDER);
     reply_word(controller, fd, CMD_HBR_SHUTDOWN, REPLY_DONE);

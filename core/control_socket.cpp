@@ -23,6 +23,7 @@
 #include "core/boot_copy.h"
 #include "core/child_supervision.h"
 #include "core/client_table.h"
+#include "core/fatal.h"
 #include "core/log_controller.h"
 #include "core/logging_run.h"
 #include "core/peer_auth.h"
@@ -84,9 +85,10 @@ void start_control_socket(LogController* controller) {
     pthread_t thread;
     int rc = pthread_create(&thread, nullptr, control_thread, controller);
     if (rc != 0) {
+        // "deamon": the history's wording, which tools match.
         HLOG(TAG_MAIN, WLOG_ERROR, "create deamon thread failed(%s)", strerror(rc));
         report_system_warning(3);
-        exit(-1);
+        daemon_exit(-1);
     }
     // Never joined: the thread lives as long as the process.
     pthread_detach(thread);
@@ -204,8 +206,8 @@ void control_loop(LogController* controller) {
         FD_ZERO(&readable);
         int max_fd = -1;
         if (controller->listen_fd >= 0) watch(&readable, controller->listen_fd, &max_fd);
-        if (efd_chld > 0) watch(&readable, efd_chld, &max_fd);
-        if (efd_thread > 0) watch(&readable, efd_thread, &max_fd);
+        if (controller->efd_chld > 0) watch(&readable, controller->efd_chld, &max_fd);
+        if (controller->efd_thread > 0) watch(&readable, controller->efd_thread, &max_fd);
         // Only this thread changes the slots, so they can be read without the lock.
         for (const ClientSlot& slot : controller->clients) {
             if (slot.fd >= 0) watch(&readable, slot.fd, &max_fd);
@@ -257,23 +259,21 @@ void control_loop(LogController* controller) {
 
         // Each counter is read once, before the record: HLOG evaluates its
         // arguments for the history and again for the platform log.
-        if (efd_chld > 0 && FD_ISSET(efd_chld, &readable)) {
-            unsigned long long deaths = read_counter(efd_chld);
+        if (controller->efd_chld > 0 && FD_ISSET(controller->efd_chld, &readable)) {
+            unsigned long long deaths = read_counter(controller->efd_chld);
             HLOG(TAG_MAIN, WLOG_INFO, "recv efd_chld %llu", deaths);
-            pid_t before[] = {controller->mlog_pid, controller->rlog_pid, controller->elog_pid,
-                              controller->klog_pid, controller->blog_pid};
+            pid_t before[LOG_TYPE_COUNT];
+            memcpy(before, controller->collector_pid, sizeof(before));
             check_children(controller);
-            pid_t after[] = {controller->mlog_pid, controller->rlog_pid, controller->elog_pid,
-                             controller->klog_pid, controller->blog_pid};
             // The daemon's own shell commands ("oru -m 3" as the boot run starts)
             // end too: only a collector's end tells that someone is there.
-            if (boot_copy_armed && ready == 1 && memcmp(before, after, sizeof(before)) == 0)
+            if (boot_copy_armed && ready == 1 && memcmp(before, controller->collector_pid, sizeof(before)) == 0)
                 controller->boot_copy_timer = 1;
         }
-        if (efd_thread > 0 && FD_ISSET(efd_thread, &readable)) {
-            // 1001 storage low, 1002 log folder lost (or their sum): either way the run ends.
+        if (controller->efd_thread > 0 && FD_ISSET(controller->efd_thread, &readable)) {
+            // EVENT_STORAGE_LOW, EVENT_FOLDER_LOST (or their sum): either way the run ends.
             // 0: a stop in this pass has already discarded what was there.
-            unsigned long long events = read_counter(efd_thread);
+            unsigned long long events = read_counter(controller->efd_thread);
             if (events != 0) {
                 HLOG(TAG_MAIN, WLOG_INFO, "recv efd_thread %llu", events);
                 stop_logging(controller);

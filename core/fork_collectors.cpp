@@ -94,7 +94,7 @@ int fork_kernel_log(LogController* controller, int block_fd) {
         HLOG(TAG_MAIN, WLOG_ERROR, "fork kernelLog failed %s", strerror(err));
         return -1;
     }
-    controller->klog_pid = pid;
+    controller->collector_pid[LOG_KERNEL] = pid;
     WLOG(TAG_MAIN, WLOG_DEBUG, "kmsgcat pid = %d", pid);
     return 0;
 }
@@ -105,7 +105,7 @@ int fork_main_log(LogController* controller, int block_fd) {
         HLOG(TAG_MAIN, WLOG_ERROR, "fork mainLog failed %s", strerror(errno));
         return -1;
     }
-    controller->mlog_pid = pid;
+    controller->collector_pid[LOG_MAIN] = pid;
     WLOG(TAG_MAIN, WLOG_DEBUG, "logcat main pid = %d", pid);
     return 0;
 }
@@ -116,7 +116,7 @@ int fork_radio_log(LogController* controller, int block_fd) {
         HLOG(TAG_MAIN, WLOG_ERROR, "fork radiolog failed %s", strerror(errno));
         return -1;
     }
-    controller->rlog_pid = pid;
+    controller->collector_pid[LOG_RADIO] = pid;
     WLOG(TAG_MAIN, WLOG_DEBUG, "logcat radio pid = %d", pid);
     return 0;
 }
@@ -127,7 +127,7 @@ int fork_events_log(LogController* controller, int block_fd) {
         HLOG(TAG_MAIN, WLOG_ERROR, "fork eventsLog failed %s", strerror(errno));
         return -1;
     }
-    controller->elog_pid = pid;
+    controller->collector_pid[LOG_EVENTS] = pid;
     WLOG(TAG_MAIN, WLOG_DEBUG, "logcat events pid = %d", pid);
     return 0;
 }
@@ -138,7 +138,7 @@ int fork_bt_log(LogController* controller, int block_fd) {
         HLOG(TAG_MAIN, WLOG_ERROR, "fork btLog failed %s", strerror(errno));
         return -1;
     }
-    controller->blog_pid = pid;
+    controller->collector_pid[LOG_BT] = pid;
     WLOG(TAG_MAIN, WLOG_DEBUG, "btcat pid = %d", pid);
     return 0;
 }

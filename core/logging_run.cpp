@@ -23,6 +23,7 @@
 #include "common/io_util.h"
 #include "common/unique_fd.h"
 #include "core/child_supervision.h"
+#include "core/fatal.h"
 #include "core/fork_collectors.h"
 #include "core/log_controller.h"
 #include "core/run_host.h"
@@ -129,26 +130,22 @@ static void release_control_block(LogController* controller) {
 
 static void create_control_block(LogController* controller) {
     release_control_block(controller);
-    shm_fd = ashmem_create_region(CONTROL_BLOCK_NAME, CONTROL_BLOCK_SIZE);
-    if (shm_fd < 0) {
+    controller->shm_fd = ashmem_create_region(CONTROL_BLOCK_NAME, CONTROL_BLOCK_SIZE);
+    if (controller->shm_fd < 0) {
         int err = errno;
-        HLOG(TAG_MAIN, WLOG_ERROR, "ashmem create failed!errno:%s(%d)", strerror(err), err);
-        exit(1);
+        DAEMON_FATAL(1, TAG_MAIN, "ashmem create failed!errno:%s(%d)", strerror(err), err);
     }
-    void* map = mmap(nullptr, CONTROL_BLOCK_SIZE, PROT_READ | PROT_WRITE, MAP_SHARED, shm_fd, 0);
+    void* map = mmap(nullptr, CONTROL_BLOCK_SIZE, PROT_READ | PROT_WRITE, MAP_SHARED, controller->shm_fd, 0);
     if (map == MAP_FAILED) {
         int err = errno;
-        HLOG(TAG_MAIN, WLOG_ERROR, "mmap shared memory failed!errno:%s(%d)", strerror(err), err);
-        exit(1);
+        DAEMON_FATAL(1, TAG_MAIN, "mmap shared memory failed!errno:%s(%d)", strerror(err), err);
     }
     // Each run has a fresh region, so a collector of an earlier run that died
     // holding the semaphore cannot hold this one.
     ControlBlock* block = static_cast<ControlBlock*>(map);
     if (control_block_init(block) != 0) {
         int err = errno;
-        HLOG(TAG_MAIN, WLOG_ERROR, "sem_init %s failed!errno:%s(%d)", CONTROL_SEM_NAME, strerror(err),
-             err);
-        exit(1);
+        DAEMON_FATAL(1, TAG_MAIN, "sem_init %s failed!errno:%s(%d)", CONTROL_SEM_NAME, strerror(err), err);
     }
     controller->shm = block;
     controller->sem = control_sem(block);
@@ -172,14 +169,13 @@ void start_logging(LogController* controller) {
     property_set(PROP_RUNNING, "1");
     controller->run_active = true;
 
-    TransistRun run = {controller->run_folder, controller->logpath,
-                       {controller->android_log != 0, controller->android_log != 0,
-                        controller->android_log != 0, controller->kernel_log != 0, controller->bt_log != 0},
-                       controller->rotate_size_kb};
+    TransistRun run = {controller->run_folder, controller->logpath, {}, controller->rotate_size_kb};
+    for (int type = 0; type < LOG_TYPE_COUNT; type++) run.enabled[type] = controller->log_on[type] != 0;
     transist_create(run_host(controller), run);
     create_control_block(controller);
 
-    if (controller->android_log) {
+    int shm_fd = controller->shm_fd;
+    if (controller->log_on[LOG_MAIN]) {
         fork_main_log(controller, shm_fd);
         fork_radio_log(controller, shm_fd);
         fork_events_log(controller, shm_fd);
@@ -188,19 +184,20 @@ void start_logging(LogController* controller) {
         mark_not_started(controller, SLOT_RADIO);
         mark_not_started(controller, SLOT_EVENTS);
     }
-    if (controller->kernel_log) {
+    if (controller->log_on[LOG_KERNEL]) {
         fork_kernel_log(controller, shm_fd);
     } else {
         mark_not_started(controller, SLOT_KERNEL);
     }
-    if (controller->bt_log) {
+    if (controller->log_on[LOG_BT]) {
         fork_bt_log(controller, shm_fd);
     } else {
         mark_not_started(controller, SLOT_BT);
     }
 
-    HLOG(TAG_MAIN, WLOG_INFO, "M(%d),R(%d),E(%d),K(%d),B(%d)", controller->mlog_pid,
-         controller->rlog_pid, controller->elog_pid, controller->klog_pid, controller->blog_pid);
+    const pid_t* pids = controller->collector_pid;
+    HLOG(TAG_MAIN, WLOG_INFO, "M(%d),R(%d),E(%d),K(%d),B(%d)", pids[LOG_MAIN], pids[LOG_RADIO],
+         pids[LOG_EVENTS], pids[LOG_KERNEL], pids[LOG_BT]);
 }
 
 static bool all_collectors_exited(const LogController* controller) {
@@ -220,8 +217,8 @@ static bool child_gone(pid_t pid) {
 // SIGKILL to every collector still running, then wait (bounded) until they are
 // gone, so that their connections are closed before the transist drains them.
 static void kill_collectors(LogController* controller) {
-    pid_t pids[LOG_TYPE_COUNT] = {controller->mlog_pid, controller->rlog_pid, controller->elog_pid,
-                                  controller->klog_pid, controller->blog_pid};
+    pid_t pids[LOG_TYPE_COUNT];
+    memcpy(pids, controller->collector_pid, sizeof(pids));
     signal_children(controller, SIGKILL);
     for (int poll = 0; poll < KILL_WAIT_POLLS; poll++) {
         bool all_gone = true;
@@ -258,9 +255,10 @@ static void join_transist_thread(pthread_t* thread, const char* which) {
 
 // A notice the writer sent while the run was stopping belongs to that run;
 // left in the counter it would stop the next run as soon as it starts.
-static void discard_stale_notices() {
+static void discard_stale_notices(LogController* controller) {
     uint64_t stale;
-    while (efd_thread >= 0 && RETRY_EINTR(read(efd_thread, &stale, sizeof(stale))) > 0) {
+    while (controller->efd_thread >= 0 &&
+           RETRY_EINTR(read(controller->efd_thread, &stale, sizeof(stale))) > 0) {
     }
 }
 
@@ -269,7 +267,7 @@ void stop_logging(LogController* controller) {
     signal(SIGCHLD, SIG_IGN);
     // The daemon's own record decides: the property may have been set by hand.
     if (!controller->run_active) {
-        controller->log_path_state = -1;
+        controller->log_path_state = LOG_PATH_UNKNOWN;
         HLOG(TAG_MAIN, WLOG_ERROR, "tavlolog already stopped, ignore this stop");
         if (is_running()) property_set(PROP_RUNNING, "0");
         return;
@@ -289,8 +287,8 @@ void stop_logging(LogController* controller) {
     }
     kill_collectors(controller);
     controller->warned = 0;
-    if (shm_fd > 0) close(shm_fd);
-    shm_fd = -1;
+    if (controller->shm_fd > 0) close(controller->shm_fd);
+    controller->shm_fd = -1;
     release_control_block(controller);
 
     // Only now that no collector can write any more may the transist finish:
@@ -303,8 +301,8 @@ void stop_logging(LogController* controller) {
     controller->run_active = false;
     // Only now: until the writer has ended it must check the free space of
     // the run's own root (/data for a run held there), not the card's.
-    controller->log_path_state = -1;
-    discard_stale_notices();
+    controller->log_path_state = LOG_PATH_UNKNOWN;
+    discard_stale_notices(controller);
     HLOG(TAG_MAIN, WLOG_INFO, "tavlolog stop done");
 }
 
@@ -334,14 +332,11 @@ void signal_child(int pid, int sig) {
 }
 
 void signal_children(LogController* controller, int sig) {
-    pid_t* pids[LOG_TYPE_COUNT] = {&controller->mlog_pid, &controller->rlog_pid,
-                                   &controller->elog_pid, &controller->klog_pid,
-                                   &controller->blog_pid};
-    for (pid_t* pid : pids) {
-        if (*pid != 0) signal_child(*pid, sig);
+    for (pid_t pid : controller->collector_pid) {
+        if (pid != 0) signal_child(pid, sig);
     }
     if (sig == SIGKILL) {
-        for (pid_t* pid : pids) *pid = 0;
+        for (pid_t& pid : controller->collector_pid) pid = 0;
     }
 }
 

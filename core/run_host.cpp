@@ -19,8 +19,8 @@ class RunHost : public TransistHost {
     // The clients hear it first; the control loop then ends the run.
     void writer_gave_up(const char* broadcast, uint64_t event) override {
         reply_client(controller, -1, broadcast);
-        if (efd_thread < 0) return;
-        RETRY_EINTR(write(efd_thread, &event, sizeof(event)));
+        if (controller->efd_thread < 0) return;
+        RETRY_EINTR(write(controller->efd_thread, &event, sizeof(event)));
     }
 
     int flush_records() override { return peer_records_flush(); }

@@ -451,3 +451,8 @@ int make_dir_recursive(const char* path) {
     errno = err;
     return 0;
 }
+
+bool path_exists(const char* path) {
+    struct stat st;
+    return lstat(path, &st) == 0;
+}

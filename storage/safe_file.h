@@ -83,3 +83,6 @@ int safe_remove_tree(int dirfd, const char* name);
 // /data). Returns 1 when the final mkdir succeeded, 0 otherwise (an existing
 // path counts as failure).
 int make_dir_recursive(const char* path);
+
+// True when path names anything, a link included (lstat).
+bool path_exists(const char* path);

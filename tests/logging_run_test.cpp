@@ -146,7 +146,7 @@ class RunTest : public ::testing::Test {
         source_ = open(kFifo, O_RDWR);  // never blocks, and the source always has a writer
         ASSERT_GE(source_, 0);
         controller_.boot_mode = 1;  // no exception-engine switch
-        controller_.kernel_log = 1;
+        controller_.log_on[LOG_KERNEL] = 1;
         controller_.log_file_num = 5;
         strcpy(controller_.logpath, "/data");  // where the writer measures free space
         ASSERT_EQ(create_run_folder(&controller_, "/data", "/data/run_test/"), 1);
@@ -180,7 +180,7 @@ TEST_F(RunTest, StopKeepsEverythingTheCollectorSent) {
     start_logging(&controller_);
     EXPECT_EQ(property(PROP_RUNNING), "1");
     EXPECT_EQ(property(PROP_LOGSIZE), "12288");
-    ASSERT_GT(controller_.klog_pid, 0);
+    ASSERT_GT(controller_.collector_pid[LOG_KERNEL], 0);
     std::string sent;
     for (int i = 0; i < 400; i++) sent += "<6>[" + std::to_string(i) + ".000000] a line of the kernel log, some padding\n";
     feed(sent);
@@ -193,14 +193,14 @@ TEST_F(RunTest, StopKeepsEverythingTheCollectorSent) {
         usleep(30000);
         feed(last);
     });
-    pid_t collector = controller_.klog_pid;
+    pid_t collector = controller_.collector_pid[LOG_KERNEL];
     stop_logging(&controller_);
     late.join();
     ASSERT_TRUE(wait_source_drained()) << "the collector ended before the late words came";
     sent += last;
 
     EXPECT_EQ(property(PROP_RUNNING), "0");
-    EXPECT_EQ(controller_.klog_pid, 0);
+    EXPECT_EQ(controller_.collector_pid[LOG_KERNEL], 0);
     EXPECT_EQ(controller_.shm, nullptr);
     std::string body = read_file("/data/run_test/kernel_log");
     EXPECT_TRUE(body == "-----timezone: GMT\n" + sent) << body.size() << " of " << sent.size() << " bytes";
@@ -220,7 +220,7 @@ TEST_F(RunTest, CollectorKeepsNoneOfTheDaemonsDescriptors) {
     feed("x\n");
     ASSERT_TRUE(wait_source_drained());
     std::string held = "\n";
-    for (int fd = 0; fd < 1024; fd++) held += fd_target(controller_.klog_pid, fd) + "\n";
+    for (int fd = 0; fd < 1024; fd++) held += fd_target(controller_.collector_pid[LOG_KERNEL], fd) + "\n";
     for (int fd : {transist_listen_fd, client_[0], log_files[LOG_KERNEL].fd}) {
         std::string target = fd_target(getpid(), fd);
         ASSERT_NE(target, "");
@@ -233,7 +233,7 @@ TEST_F(RunTest, CollectorKeepsNoneOfTheDaemonsDescriptors) {
 // checks /data, and a notice sent during the stop does not outlive it.
 TEST_F(RunTest, StopLeavesNoFalseOrStaleStorageNotice) {
     strcpy(controller_.logpath, "/mnt/no_card");
-    controller_.log_path_state = 0;
+    controller_.log_path_state = LOG_PATH_HELD_IN_DATA;
     start_logging(&controller_);
     pid_t slow = fork();  // ignores the stop request: the stop waits its full second
     if (slow == 0) {
@@ -241,13 +241,13 @@ TEST_F(RunTest, StopLeavesNoFalseOrStaleStorageNotice) {
         pause();
         _exit(0);
     }
-    controller_.mlog_pid = slow;
+    controller_.collector_pid[LOG_MAIN] = slow;
     controller_.shm->slots[SLOT_MAIN].exited = 0;
     uint64_t notice = 1001;
-    ASSERT_EQ(write(efd_thread, &notice, sizeof(notice)), 8);
+    ASSERT_EQ(write(controller_.efd_thread, &notice, sizeof(notice)), 8);
     stop_logging(&controller_);
     EXPECT_FALSE(history_has("no space to write log"));
-    EXPECT_EQ(read(efd_thread, &notice, sizeof(notice)), -1) << "a stale notice would stop the next run";
+    EXPECT_EQ(read(controller_.efd_thread, &notice, sizeof(notice)), -1) << "a stale notice would stop the next run";
 }
 
 // A collector that cannot open its source ends with its reason; being the
@@ -255,10 +255,10 @@ TEST_F(RunTest, StopLeavesNoFalseOrStaleStorageNotice) {
 TEST_F(RunTest, CollectorThatCannotOpenItsSourceStopsTheRun) {
     KmsgCat::kmsg_path = "/tmp/no_such_kmsg";
     start_logging(&controller_);
-    struct pollfd p = {efd_chld, POLLIN, 0};  // the SIGCHLD notice, as the control loop waits for it
+    struct pollfd p = {controller_.efd_chld, POLLIN, 0};  // the SIGCHLD notice, as the control loop waits for it
     uint64_t count;
     ASSERT_TRUE(wait_for([&] { return poll(&p, 1, 0) == 1; }, 5000));
-    ASSERT_EQ(read(efd_chld, &count, sizeof(count)), 8);
+    ASSERT_EQ(read(controller_.efd_chld, &count, sizeof(count)), 8);
     check_children(&controller_);
     EXPECT_TRUE(history_has("oru warning comes,type is 10"));
     EXPECT_EQ(property(PROP_RUNNING), "0");

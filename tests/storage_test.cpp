@@ -4,7 +4,6 @@
 
 #include <map>
 
-#include "core/log_controller.h"
 #include "storage/debug_dump.h"
 #include "storage/folder_records.h"
 #include "storage/log_copy.h"
@@ -170,15 +169,12 @@ TEST(CopyLogFolder, AppendsOldestPieceFirstAndKeepsWhatCannotGo) {
         ASSERT_EQ(0, system(("rm -rf " + kHeld + " " + kRun + "; mkdir -p " + kHeld + " " + kRun).c_str()));
         for (const auto& f : c.held) f.first.back() == '/' ? (void)mkdir((kHeld + f.first).c_str(), 0700) : write_file(kHeld + f.first, f.second);
         write_file(kRun + "kernel_log.boot", "old");
-        LogController controller;
-        strcpy(controller.logpath, "/mnt/sdcard");
-        controller.kernel_log = c.kernel;
-        controller.android_log = c.android;
-        controller.bt_log = c.bt;
-        data_storage_low = c.low;
+        int warned = 0;
+        HeldCopy copy = {"/mnt/sdcard", {c.android != 0, c.android != 0, c.android != 0, c.kernel != 0, c.bt != 0},
+                         c.low != 0, &warned};
         struct rlimit limit = {c.file_limit, RLIM_INFINITY};
         setrlimit(RLIMIT_FSIZE, &limit);
-        CopyResult result = copy_log_folder(&controller, kHeld.c_str(), kRun.c_str(), ".boot");
+        CopyResult result = copy_log_folder(copy, kHeld.c_str(), kRun.c_str(), ".boot");
         limit.rlim_cur = RLIM_INFINITY;
         setrlimit(RLIMIT_FSIZE, &limit);
         EXPECT_EQ(c.result, result);
