@@ -61,7 +61,7 @@ int control_block_lock(sem_t* sem) {
         deadline.tv_sec += 1;
         deadline.tv_nsec -= 1000000000L;
     }
-    if (RETRY_EINTR(sem_timedwait(sem, &deadline)) == 0) return 1;
+    if (TEMP_FAILURE_RETRY(sem_timedwait(sem, &deadline)) == 0) return 1;
     // Platform log only: this may run in the stop handler, and the platform
     // writer takes no lock.
     WLOG(TAG_MAIN, WLOG_WARN, "semaphore %s busy for %ld ms, going on without it", CONTROL_SEM_NAME,
@@ -215,6 +215,7 @@ void exit_collector(CollectorLink* collector, int status, int reason) {
     }
     int slot = log_type_from_letter(collector->log_type) + 1;
     if (slot < SLOT_MAIN) {
+        // "unknow" as stored histories and tools have it.
         COLLECTOR_HLOG(collector->kind, WLOG_ERROR, "unknow log type %c", collector->log_type);
         _exit(status);
     }

@@ -339,7 +339,7 @@ void LogCat::run(const char*, const char* device, int block_fd) {
     }
     bool any_binary = false;
     for (LogDevice* d = devices; d != nullptr; d = d->next) {
-        d->fd = RETRY_EINTR(open(d->device, O_RDONLY | O_CLOEXEC));
+        d->fd = TEMP_FAILURE_RETRY(open(d->device, O_RDONLY | O_CLOEXEC));
         if (d->fd < 0) {
             HLOG(TAG_ANDROID, WLOG_ERROR, "Unable to open log device '%s': %s", d->device,
                  strerror(errno));

@@ -23,9 +23,9 @@ int peer_credentials(int fd, uid_t* uid, pid_t* pid) {
 static pid_t parent_of(pid_t pid) {
     char path[32];
     snprintf(path, sizeof(path), "/proc/%d/stat", static_cast<int>(pid));
-    UniqueFd fd(RETRY_EINTR(open(path, O_RDONLY | O_CLOEXEC)));
+    UniqueFd fd(TEMP_FAILURE_RETRY(open(path, O_RDONLY | O_CLOEXEC)));
     char stat[512];
-    ssize_t n = fd.ok() ? RETRY_EINTR(read(fd.get(), stat, sizeof(stat) - 1)) : -1;
+    ssize_t n = fd.ok() ? TEMP_FAILURE_RETRY(read(fd.get(), stat, sizeof(stat) - 1)) : -1;
     if (n <= 0) return -1;
     stat[n] = '\0';
     const char* end = strrchr(stat, ')');

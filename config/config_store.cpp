@@ -51,7 +51,7 @@ class LineReader {
         size_t n = 0;
         while (n < READ_PIECE_LEN) {
             if (pos_ == len_) {
-                ssize_t r = RETRY_EINTR(read(fd_, buf_, sizeof(buf_)));
+                ssize_t r = TEMP_FAILURE_RETRY(read(fd_, buf_, sizeof(buf_)));
                 if (r < 0 && n == 0) return -1;
                 if (r <= 0) break;
                 pos_ = 0;
@@ -84,7 +84,7 @@ ConfigItem* find_item(ConfigCache* cache, const char* key) {
 int open_for_reading(const char* path) {
     const char* root = trusted_root_of(path, nullptr);
     if (root != nullptr) return safe_open_path_file(root, path, SAFE_READ, 0);
-    return RETRY_EINTR(open(path, O_RDONLY | O_CLOEXEC));
+    return TEMP_FAILURE_RETRY(open(path, O_RDONLY | O_CLOEXEC));
 }
 
 }  // namespace
@@ -182,6 +182,7 @@ static void apply_log_path_override(ConfigCache* cache) {
 
 int config_load(ConfigCache* cache) {
     if (config_read_file(cache, CONFIG_FILE) == 0) {
+        // "some thing" as stored histories and tools have it.
         HLOG(TAG_CONFIG, WLOG_ERROR, "some thing wrong when read %s,recreate a new one", CONFIG_FILE);
         config_write(cache);
     }
@@ -196,6 +197,7 @@ int config_write(const ConfigCache* cache) {
     int fd = dir.ok() ? safe_replace_begin(dir.get(), CONFIG_NAME, CONFIG_FILE_MODE) : -1;
     if (fd < 0) {
         int err = errno;
+        // "cant" as stored histories and tools have it.
         HLOG(TAG_CONFIG, WLOG_ERROR, "cant open the config file,errno=%d,%s", err, strerror(err));
         return -1;
     }
@@ -209,6 +211,7 @@ int config_write(const ConfigCache* cache) {
             int err = errno;
             // The record names the item without its line feed: one record, one line.
             if (len > 0 && len < static_cast<int>(sizeof(line))) line[len - 1] = '\0';
+            // "erron" as stored histories and tools have it.
             HLOG(TAG_CONFIG, WLOG_ERROR, "write %s to configure file failed,erron:%d", line, err);
             // The old file stays in place rather than be replaced by an incomplete one.
             safe_replace_abort(dir.get(), CONFIG_NAME, fd);
@@ -218,6 +221,7 @@ int config_write(const ConfigCache* cache) {
     }
     if (safe_replace_commit(dir.get(), CONFIG_NAME, fd) != 0) {
         int err = errno;
+        // "erron" as stored histories and tools have it.
         HLOG(TAG_CONFIG, WLOG_ERROR, "write %s to configure file failed,erron:%d", CONFIG_FILE, err);
         return -1;
     }

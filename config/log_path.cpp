@@ -29,6 +29,7 @@ void storage_dir(const char* property, const char* fallback, char* out) {
     char dir[PROPERTY_VALUE_MAX];
     property_get(property, dir, "");
     if (!is_clean_absolute_path(dir)) {
+        // "cant" as stored histories and tools have it.
         HLOG(TAG_CONFIG, WLOG_ERROR, "cant get log path through property %s", property);
         copy_str(out, LOG_PATH_VALUE_MAX, fallback);
     } else {

@@ -63,6 +63,7 @@ void normal_boot(LogController* controller, ConfigCache* config) {
     if (controller->sd_log_path) {
         if (!start_in_temp_folder(controller)) return;
         if (controller->data_storage_low == 1) {
+            // "dont" as stored histories and tools have it.
             HLOG(TAG_MAIN, WLOG_ERROR, "/data is low, dont start children process(2)");
             controller->log_path_state = LOG_PATH_UNDER_LOGPATH;
             return;
@@ -82,6 +83,7 @@ void kelm_boot(LogController* controller, ConfigCache* config) {
     controller->boot_copy_timer = 0;
     if (!start_in_temp_folder(controller)) return;
     if (controller->data_storage_low == 1) {
+        // "dont" as stored histories and tools have it.
         HLOG(TAG_MAIN, WLOG_ERROR, "/data is low, dont start tqlog");
         return;
     }
@@ -176,6 +178,7 @@ int start_in_temp_folder(LogController* controller) {
         }
     }
     if (create_run_folder(controller, "/data", TEMP_FOLDER) < 0) {
+        // "faild" as stored histories and tools have it.
         HLOG(TAG_MAIN, WLOG_ERROR, "mkdir %s faild,errno=%d", TEMP_FOLDER, errno);
         return 0;
     }

@@ -71,7 +71,7 @@ void check_children(LogController* controller) {
     for (int type : order) {
         pid_t* pid = &controller->collector_pid[type];
         if (!controller->log_on[type] || *pid == 0 || !is_dead(*pid)) continue;
-        // "dies unexpectly": the history's wording, which tools match.
+        // "dies unexpectly" as stored histories and tools have it.
         switch (type) {
             case LOG_KERNEL: HLOG(TAG_MAIN, WLOG_ERROR, "kLog dies unexpectly"); break;
             case LOG_MAIN: HLOG(TAG_MAIN, WLOG_ERROR, "mLog dies unexpectly"); break;
@@ -83,7 +83,7 @@ void check_children(LogController* controller) {
     }
 
     if (all_pids_clear(controller)) {
-        // "chil": the history's wording, which tools match.
+        // "chil" as stored histories and tools have it.
         HLOG(TAG_MAIN, WLOG_ERROR, "all chil processes die");
         reply_client(controller, -1, BROADCAST_STOPPED);
         stop_logging(controller);

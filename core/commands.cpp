@@ -156,6 +156,7 @@ static int move_run_to_log_path(LogController* controller, int fd) {
 static int cmd_copy(LogController* controller, int fd) {
     if (run_live(controller)) {
         if (controller->log_path_state == LOG_PATH_UNDER_LOGPATH) {
+            // "copyed" as stored histories and tools have it.
             HLOG(TAG_MAIN, WLOG_ERROR, "has copyed to sd,ignore this 'copy'");
             reply_word(controller, fd, CMD_COPY, REPLY_DONE);
             return 1;
@@ -210,7 +211,7 @@ static int cmd_hbr_shutdown(LogController* controller, int fd) {
 int handle_client_message(LogController* controller, int fd) {
     // One spare byte so that the text is terminated even when the read is full.
     char message[CONTROL_MSG_MAX + 1] = {};
-    ssize_t n = RETRY_EINTR(read(fd, message, CONTROL_MSG_MAX));
+    ssize_t n = TEMP_FAILURE_RETRY(read(fd, message, CONTROL_MSG_MAX));
     if (n < 0) {
         // Nothing there after all (the socket is non-blocking): keep the client.
         if (errno == EAGAIN || errno == EWOULDBLOCK) return 1;

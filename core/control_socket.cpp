@@ -85,7 +85,7 @@ void start_control_socket(LogController* controller) {
     pthread_t thread;
     int rc = pthread_create(&thread, nullptr, control_thread, controller);
     if (rc != 0) {
-        // "deamon": the history's wording, which tools match.
+        // "deamon" as stored histories and tools have it.
         HLOG(TAG_MAIN, WLOG_ERROR, "create deamon thread failed(%s)", strerror(rc));
         report_system_warning(3);
         daemon_exit(-1);
@@ -113,7 +113,7 @@ static int accept_client(LogController* controller) {
     socklen_t addr_len = sizeof(addr);
     // Non-blocking: a client that connects and then misbehaves must not be
     // able to stall the only event loop. CLOEXEC: see start_control_socket.
-    int fd = RETRY_EINTR(accept4(controller->listen_fd, reinterpret_cast<sockaddr*>(addr),
+    int fd = TEMP_FAILURE_RETRY(accept4(controller->listen_fd, reinterpret_cast<sockaddr*>(addr),
                                  &addr_len, SOCK_CLOEXEC | SOCK_NONBLOCK));
     if (fd < 0) {
         HLOG(TAG_MAIN, WLOG_ERROR, "accept failed %s(%d)", strerror(errno), errno);
@@ -176,7 +176,7 @@ static void serve_clients(LogController* controller, fd_set* readable) {
 // Reads an eventfd counter; 0 when there was nothing to read.
 static unsigned long long read_counter(int fd) {
     uint64_t value = 0;
-    if (RETRY_EINTR(read(fd, &value, sizeof(value))) != sizeof(value)) return 0;
+    if (TEMP_FAILURE_RETRY(read(fd, &value, sizeof(value))) != sizeof(value)) return 0;
     return value;
 }
 

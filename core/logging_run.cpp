@@ -258,7 +258,7 @@ static void join_transist_thread(pthread_t* thread, const char* which) {
 static void discard_stale_notices(LogController* controller) {
     uint64_t stale;
     while (controller->efd_thread >= 0 &&
-           RETRY_EINTR(read(controller->efd_thread, &stale, sizeof(stale))) > 0) {
+           TEMP_FAILURE_RETRY(read(controller->efd_thread, &stale, sizeof(stale))) > 0) {
     }
 }
 

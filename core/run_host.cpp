@@ -20,7 +20,7 @@ class RunHost : public TransistHost {
     void writer_gave_up(const char* broadcast, uint64_t event) override {
         reply_client(controller, -1, broadcast);
         if (controller->efd_thread < 0) return;
-        RETRY_EINTR(write(controller->efd_thread, &event, sizeof(event)));
+        TEMP_FAILURE_RETRY(write(controller->efd_thread, &event, sizeof(event)));
     }
 
     int flush_records() override { return peer_records_flush(); }

@@ -107,14 +107,14 @@ CopyResult copy_log_file(const HeldCopy& copy, const char* src, const char* dst)
         return copy_failed(copy, src, out.get(), before, true);
     if (in.ok()) {
         char buf[COPY_BUF];
-        for (ssize_t n; (n = RETRY_EINTR(read(in.get(), buf, sizeof(buf)))) != 0;) {
+        for (ssize_t n; (n = TEMP_FAILURE_RETRY(read(in.get(), buf, sizeof(buf)))) != 0;) {
             if (n < 0) return copy_failed(copy, src, out.get(), before, false);
             if (write_fully(out.get(), buf, static_cast<size_t>(n)) != n)
                 return copy_failed(copy, src, out.get(), before, true);
         }
         // The source goes only once the copy is on storage: a power cut between
         // the delete and the write-back would lose both.
-        if (RETRY_EINTR(fsync(out.get())) != 0) return copy_failed(copy, src, out.get(), before, true);
+        if (TEMP_FAILURE_RETRY(fsync(out.get())) != 0) return copy_failed(copy, src, out.get(), before, true);
         if (safe_remove_file(dir.get(), slash + 1) != 0) {
             int err = errno;
             HLOG(TAG_MAIN, WLOG_ERROR, "remove %s failed(%s)", src, strerror(err));
@@ -131,7 +131,7 @@ CopyResult copy_named_file(const HeldCopy& copy, const char* src_dir, const char
     char dst[PATH_LEN];
     if (!join(src, src_dir, name) || !join(dst, dst_dir, name)) return COPY_KEPT;
     if (!path_exists(src)) {
-        // "is not exits": the history's wording, which tools match.
+        // "is not exits" as stored histories and tools have it.
         HLOG(TAG_MAIN, WLOG_ERROR, "%s is not exits", src);
         return COPY_DONE;
     }

@@ -112,7 +112,7 @@ static int open_in_folder(int dirfd, const char* name, const char* path) {
         int err = errno;
         HLOG(TAG_TRANSIST, WLOG_ERROR, "write %s fail,%s(%d)", path, strerror(err), err);
     }
-    RETRY_EINTR(fsync(fd));
+    TEMP_FAILURE_RETRY(fsync(fd));
     return fd;
 }
 
@@ -187,7 +187,7 @@ int write_log_data(int type, const char* buf, int len) {
 void close_log_file(LogFile* entry) {
     if (entry->fd > 0) {
         // Closed for good: what the collectors sent must survive a power cut.
-        RETRY_EINTR(fsync(entry->fd));
+        TEMP_FAILURE_RETRY(fsync(entry->fd));
         close(entry->fd);
     }
     entry->fd = -1;
@@ -216,7 +216,7 @@ void sync_retired_files() {
     retired_count = 0;
     pthread_mutex_unlock(&file_table_lock);
     for (int i = 0; i < count; i++) {
-        RETRY_EINTR(fsync(fds[i]));
+        TEMP_FAILURE_RETRY(fsync(fds[i]));
         close(fds[i]);
     }
 }

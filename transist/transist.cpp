@@ -103,7 +103,7 @@ bool wait_reader_done(int ms) {
 void wake_reader() {
     if (reader_wake_fd < 0) return;
     uint64_t one = 1;
-    RETRY_EINTR(write(reader_wake_fd, &one, sizeof(one)));
+    TEMP_FAILURE_RETRY(write(reader_wake_fd, &one, sizeof(one)));
 }
 
 static void close_if_open(int* fd) {

@@ -218,7 +218,7 @@ static void accept_connections() {
             // Usually out of descriptors: give the system a moment, but stay
             // responsive to a stop.
             struct pollfd wake = {reader_wake_fd, POLLIN, 0};
-            if (!stop_requested) RETRY_EINTR(poll(&wake, 1, 1000));
+            if (!stop_requested) TEMP_FAILURE_RETRY(poll(&wake, 1, 1000));
             return;
         }
         if (!log_peer_allowed(fd)) {
@@ -422,7 +422,7 @@ void* read_thread(void*) {
             if (err == EINTR) continue;
             HLOG(TAG_TRANSIST, WLOG_ERROR, "select failed (%s), error = %d", strerror(err), err);
             struct pollfd wake = {reader_wake_fd, POLLIN, 0};
-            RETRY_EINTR(poll(&wake, 1, 1000));
+            TEMP_FAILURE_RETRY(poll(&wake, 1, 1000));
             continue;
         }
         if (n > 0) {
