@@ -13,6 +13,7 @@
 #include "core/boot_mode.h"
 #include "core/child_supervision.h"
 #include "core/log_controller.h"
+#include "core/run_host.h"
 #include "test_util.h"
 #include "transist/log_files.h"
 #include "transist/transist.h"
@@ -248,6 +249,18 @@ TEST_F(RunTest, StopLeavesNoFalseOrStaleStorageNotice) {
     stop_logging(&controller_);
     EXPECT_FALSE(history_has("no space to write log"));
     EXPECT_EQ(read(controller_.efd_thread, &notice, sizeof(notice)), -1) << "a stale notice would stop the next run";
+}
+
+// The writer's give-up: every client hears the word before the control loop
+// is woken to end the run. One stream stands for both, so it shows their order.
+TEST_F(RunTest, WriterGivingUpTellsTheClientsBeforeTheControlLoop) {
+    controller_.efd_thread = client_[0];
+    run_host(&controller_)->writer_gave_up(BROADCAST_STORAGE_FULL, EVENT_STORAGE_LOW);
+    char buf[64];
+    ssize_t n = recv(client_[1], buf, sizeof(buf), MSG_DONTWAIT);
+    uint64_t event = EVENT_STORAGE_LOW;
+    EXPECT_EQ(std::string(buf, n > 0 ? static_cast<size_t>(n) : 0),
+              BROADCAST_STORAGE_FULL + std::string(reinterpret_cast<const char*>(&event), sizeof(event)));
 }
 
 // A collector that cannot open its source ends with its reason; being the
