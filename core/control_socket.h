@@ -15,5 +15,6 @@ void start_control_socket(LogController* controller);
 void control_loop(LogController* controller);
 int handle_client_message(LogController* controller, int fd);
 // Applies one key=value message. Returns 0 when it was refused as unsafe to
-// store (a line feed, too long, a logpath that is no absolute path), else 1.
+// store (a line feed, too long, a logpath that cannot be used) or the file
+// could not be written, else 1.
 int apply_config_message(LogController* controller, char* text);
