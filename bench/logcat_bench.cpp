@@ -37,7 +37,11 @@
 #include "collectors/log_cat.h"
 #include "core/log_controller.h"
 #include "core/logging_run.h"
+#include "core/run_host.h"
 #include "platform/logger_write.h"
+#include "record/record.h"
+#include "storage/history_log.h"
+#include "transist/log_files.h"
 #include "transist/transist.h"
 #include "transist/transist_state.h"
 
@@ -184,12 +188,12 @@ bool check_main_log(const char* folder, int n, std::string* why) {
 
 LogController* bench_controller(const char* folder, bool android, bool kernel, bool bt) {
     LogController* controller = new LogController();  // lives as long as the process
-    controller->android_log = android;
-    controller->kernel_log = kernel;
-    controller->bt_log = bt;
+    controller->log_on[LOG_MAIN] = controller->log_on[LOG_RADIO] = controller->log_on[LOG_EVENTS] = android;
+    controller->log_on[LOG_KERNEL] = kernel;
+    controller->log_on[LOG_BT] = bt;
     controller->log_file_num = 25;
     controller->boot_mode = 1;  // no exception-engine switch
-    controller->log_path_state = 0;
+    controller->log_path_state = LOG_PATH_HELD_IN_DATA;
     controller->rotate_size_kb = NO_ROTATION_KB;
     snprintf(controller->run_folder, sizeof(controller->run_folder), "%s", folder);
     return controller;
@@ -274,7 +278,7 @@ Engine engine_from_memory(int n) {
     android_log_format_free(format);
 
     LogController* controller = bench_controller(RUN_D, true, false, false);
-    transist_create(controller, RUN_D, NO_ROTATION_KB);
+    transist_create(run_host(controller), {RUN_D, "", {true, true, true, false, false}, NO_ROTATION_KB});
     double cpu0 = self_cpu_s();
     t0 = now_s();
     pid_t pid = fork();
@@ -327,7 +331,7 @@ EndToEnd end_to_end(int n, pid_t logger) {
     LogController* controller = bench_controller(RUN_E, true, false, false);
     start_logging(controller);
     while (log_files[LOG_MAIN].sock < 0) usleep(1000);  // the collector is connected
-    double collector0 = stat_cpu_s("/proc/" + std::to_string(controller->mlog_pid) + "/stat");
+    double collector0 = stat_cpu_s("/proc/" + std::to_string(controller->collector_pid[LOG_MAIN]) + "/stat");
     double transist0 = transist_cpu_s(), logger0 = stat_cpu_s("/proc/" + std::to_string(logger) + "/stat");
     double t0 = now_s();
     pid_t writer = fork();
@@ -353,7 +357,7 @@ EndToEnd end_to_end(int n, pid_t logger) {
         usleep(10000);
     }
     r.rate = n / (now_s() - t0);
-    r.collector_cpu = stat_cpu_s("/proc/" + std::to_string(controller->mlog_pid) + "/stat") - collector0;
+    r.collector_cpu = stat_cpu_s("/proc/" + std::to_string(controller->collector_pid[LOG_MAIN]) + "/stat") - collector0;
     r.transist_cpu = transist_cpu_s() - transist0;
     r.logger_cpu = stat_cpu_s("/proc/" + std::to_string(logger) + "/stat") - logger0;
     stop_run(controller);
@@ -393,8 +397,7 @@ double idle_wakeups(int seconds, std::string* detail) {
         std::string comm = read_text(task + "/comm");
         if (comm == "tavlo.reader\n" || comm == "tavlo.writer\n") tasks.push_back(task);
     }
-    for (pid_t pid : {controller->mlog_pid, controller->rlog_pid, controller->elog_pid, controller->klog_pid,
-                      controller->blog_pid}) {
+    for (pid_t pid : controller->collector_pid) {
         for (const std::string& task : tasks_of(pid)) tasks.push_back(task);
     }
     std::vector<long> before;
@@ -418,6 +421,7 @@ double idle_wakeups(int seconds, std::string* detail) {
 }  // namespace
 
 int main(int argc, char** argv) {
+    record_set_history_sink(history_vlog);  // as the daemon records
     int n = argc > 1 ? atoi(argv[1]) : 200000;
     int idle_s = argc > 2 ? atoi(argv[2]) : 10;
     if (n < 2 || idle_s < 1) {

@@ -38,10 +38,13 @@
 #include <thread>
 #include <vector>
 
-#include "common/io_util.h"
 #include "collectors/kmsg_cat.h"
+#include "common/io_util.h"
 #include "core/log_controller.h"
 #include "core/logging_run.h"
+#include "core/run_host.h"
+#include "record/record.h"
+#include "storage/history_log.h"
 #include "transist/transist.h"
 
 namespace {
@@ -173,9 +176,9 @@ struct Result {
 Result bench_transist(long per_stream, int rotate_kb, size_t send_size) {
     Result r;
     LogController* controller = new LogController();  // lives as long as the process
-    controller->android_log = controller->kernel_log = controller->bt_log = 1;
-    controller->log_path_state = 0;  // a run in /data
-    transist_create(controller, RUN_A, rotate_kb);
+    for (int& on : controller->log_on) on = 1;
+    controller->log_path_state = LOG_PATH_HELD_IN_DATA;  // a run in /data
+    transist_create(run_host(controller), {RUN_A, "", {true, true, true, true, true}, rotate_kb});
 
     int go[2];
     if (pipe(go) != 0) {
@@ -290,10 +293,10 @@ bool bench_kernel_fifo(long bytes, Result* out) {
     if (hold < 0) return false;
 
     LogController* controller = new LogController();  // lives as long as the process
-    controller->kernel_log = 1;
+    controller->log_on[LOG_KERNEL] = 1;
     controller->log_file_num = 5;
     controller->boot_mode = 1;  // no exception-engine switch
-    controller->log_path_state = 0;
+    controller->log_path_state = LOG_PATH_HELD_IN_DATA;
     snprintf(controller->run_folder, sizeof(controller->run_folder), "%s", RUN_C);
     controller->rotate_size_kb = calc_rotate_size(controller, 60);
     fflush(stdout);  // the forked collector must not print this program's buffer again
@@ -313,7 +316,7 @@ bool bench_kernel_fifo(long bytes, Result* out) {
         if (ioctl(hold, FIONREAD, &unread) != 0) break;
         if (unread > 0) usleep(1000);
     }
-    double collector_cpu = pid_cpu_s(controller->klog_pid);
+    double collector_cpu = pid_cpu_s(controller->collector_pid[LOG_KERNEL]);
     stop_logging(controller);
     out->seconds = now_s() - t0;
     // The feeding loop runs in this process too; it is about what (b) spends.
@@ -362,6 +365,7 @@ extern "C" int renameat(int from_dir, const char* from, int to_dir, const char* 
 }
 
 int main(int argc, char** argv) {
+    record_set_history_sink(history_vlog);  // as the daemon records
     long total_mb = argc > 1 ? atol(argv[1]) : 100;
     int rotate_kb = argc > 2 ? atoi(argv[2]) : 2457;
     size_t send_size = argc > 3 ? static_cast<size_t>(atol(argv[3])) : 4096;

@@ -12,9 +12,8 @@
 #include <cutils/sockets.h>
 
 #include "collectors/control_block.h"
-#include "common/wlog.h"
-#include "storage/history_log.h"
-#include "storage/record_limit.h"
+#include "record/record.h"
+#include "record/record_limit.h"
 
 unsigned int BtCat::pause_us = 1000000;
 

@@ -17,9 +17,7 @@
 #include "collectors/control_block.h"
 #include "common/io_util.h"
 #include "common/log_types.h"
-#include "common/wlog.h"
-#include "storage/history_log.h"
-#include "transist/transist.h"
+#include "record/record.h"
 
 CollectorLink* volatile current_collector = nullptr;
 volatile sig_atomic_t stop_signalled = 0;
@@ -46,7 +44,7 @@ constexpr long SEM_WAIT_LIMIT_NS = 500L * 1000 * 1000;
 
 #define COLLECTOR_HLOG(kind, prio, fmt, ...)                                  \
     do {                                                                      \
-        history_log(2, fmt, ##__VA_ARGS__);                                   \
+        record_history(2, fmt, ##__VA_ARGS__);                                \
         COLLECTOR_WLOG(kind, prio, fmt, ##__VA_ARGS__);                       \
     } while (0)
 
@@ -65,7 +63,7 @@ int control_block_lock(sem_t* sem) {
         deadline.tv_sec += 1;
         deadline.tv_nsec -= 1000000000L;
     }
-    if (RETRY_EINTR(sem_timedwait(sem, &deadline)) == 0) return 1;
+    if (TEMP_FAILURE_RETRY(sem_timedwait(sem, &deadline)) == 0) return 1;
     // Platform log only: this may run in the stop handler, and the platform
     // writer takes no lock.
     WLOG(TAG_MAIN, WLOG_WARN, "semaphore %s busy for %ld ms, going on without it", CONTROL_SEM_NAME,
@@ -219,6 +217,7 @@ void exit_collector(CollectorLink* collector, int status, int reason) {
     }
     int slot = log_type_from_letter(collector->log_type) + 1;
     if (slot < SLOT_MAIN) {
+        // "unknow" as stored histories and tools have it.
         COLLECTOR_HLOG(collector->kind, WLOG_ERROR, "unknow log type %c", collector->log_type);
         _exit(status);
     }

@@ -7,6 +7,8 @@
 #include <stdint.h>
 #include <string.h>
 
+#include "common/log_types.h"
+
 constexpr int CONTROL_SLOT_COUNT = 6;
 constexpr int CONTROL_SLOT_SIZE = 264;
 constexpr int CONTROL_BLOCK_SIZE = CONTROL_SLOT_COUNT * CONTROL_SLOT_SIZE;  // 1584
@@ -36,6 +38,12 @@ static_assert(offsetof(ControlBlock, slots[5].reason) == 1324, "bluetooth slot r
 
 // Slot of each collector: the log type index plus 1.
 enum { SLOT_RUN = 0, SLOT_MAIN = 1, SLOT_RADIO = 2, SLOT_EVENTS = 3, SLOT_KERNEL = 4, SLOT_BT = 5 };
+
+// The slot of a log type's collector: the types in their order, after the run's slot.
+inline int control_slot_of(int type) { return SLOT_MAIN + type; }
+static_assert(SLOT_MAIN == 1 + LOG_MAIN && SLOT_RADIO == 1 + LOG_RADIO && SLOT_EVENTS == 1 + LOG_EVENTS &&
+                  SLOT_KERNEL == 1 + LOG_KERNEL && SLOT_BT == 1 + LOG_BT,
+              "slots follow the log types");
 
 // Reason codes a collector leaves in its slot.
 enum {

@@ -11,8 +11,7 @@
 
 #include "collectors/control_block.h"
 #include "common/io_util.h"
-#include "common/wlog.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 
 const char* KmsgCat::kmsg_path = "/proc/kmsg";
 
@@ -34,7 +33,7 @@ void KmsgCat::run(const char*, int block_fd) {
         _exit(1);  // see exit_collector
     }
 
-    int kmsg_fd = RETRY_EINTR(open(kmsg_path, O_RDONLY | O_NONBLOCK | O_CLOEXEC));
+    int kmsg_fd = TEMP_FAILURE_RETRY(open(kmsg_path, O_RDONLY | O_NONBLOCK | O_CLOEXEC));
     if (kmsg_fd < 0) {
         int err = errno;
         fprintf(stderr, "Unable to open /proc/kmsg: %s\n", strerror(err));

@@ -18,8 +18,7 @@
 #include "collectors/control_block.h"
 #include "common/io_util.h"
 #include "common/limits.h"
-#include "common/wlog.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 
 const char* LogCat::device_root = "/dev/log/";
 
@@ -355,7 +354,7 @@ void LogCat::run(const char*, const char* device, int block_fd) {
     }
     bool any_binary = false;
     for (LogDevice* d = devices; d != nullptr; d = d->next) {
-        d->fd = RETRY_EINTR(open(d->device, O_RDONLY | O_CLOEXEC));
+        d->fd = TEMP_FAILURE_RETRY(open(d->device, O_RDONLY | O_CLOEXEC));
         if (d->fd < 0) {
             HLOG(TAG_ANDROID, WLOG_ERROR, "Unable to open log device '%s': %s", d->device,
                  strerror(errno));

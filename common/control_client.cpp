@@ -11,6 +11,7 @@
 
 #include <cutils/sockets.h>
 
+#include "common/clock.h"
 #include "common/io_util.h"
 
 // Pause between connection attempts while the daemon's backlog is full.
@@ -44,21 +45,15 @@ int control_server_trusted(uid_t uid) {
            uid == static_cast<uid_t>(CONTROL_UID_SHELL);
 }
 
-static long long now_ms() {
-    struct timespec ts;
-    clock_gettime(CLOCK_MONOTONIC, &ts);
-    return static_cast<long long>(ts.tv_sec) * 1000 + ts.tv_nsec / 1000000;
-}
-
 // Milliseconds left until deadline (never negative); -1 for no deadline.
 static int remaining_ms(long long deadline) {
     if (deadline < 0) return -1;
-    long long left = deadline - now_ms();
+    long long left = deadline - monotonic_ms();
     return left > 0 ? static_cast<int>(left) : 0;
 }
 
 static long long deadline_after(int timeout_ms) {
-    return timeout_ms < 0 ? -1 : now_ms() + timeout_ms;
+    return timeout_ms < 0 ? -1 : monotonic_ms() + timeout_ms;
 }
 
 // Waits until fd is ready for events. Returns CC_OK or CC_TIMEOUT/CC_IO.

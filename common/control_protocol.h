@@ -12,7 +12,7 @@
 #include <stddef.h>
 #include <string.h>
 
-// Abstract-namespace local socket (same text as core/control_socket.h).
+// Abstract-namespace local socket.
 #define CONTROL_SOCKET_NAME "tavlologd"
 constexpr int CONTROL_BACKLOG = 4;
 
@@ -66,6 +66,20 @@ constexpr int REPLY_SUFFIX_LEN = 2;
 constexpr const char* control_broadcasts[] = {BROADCAST_STOPPED, BROADCAST_STORAGE_FULL,
                                               BROADCAST_FOLDER_LOST};
 constexpr int CONTROL_BROADCAST_COUNT = sizeof(control_broadcasts) / sizeof(control_broadcasts[0]);
+
+// The daemon's run state as clients read it from system properties.
+#define PROP_RUNNING "debug.TQ.running"    // "1" while a logging run is active
+#define PROP_REALPATH "debug.TQ.realpath"  // the run folder, "" when none
+#define PROP_LOGSIZE "debug.TQ.logsize"    // the rotation size of the run in KB
+// Which collectors of the run are alive, in the fixed order of the log types:
+// "main=up,radio=up,events=up,kernel=down,bt=off" (up: running; down: enabled
+// but ended, or never started; off: not enabled for this run); "" while no run
+// is active. Updated at run start, at each death and at stop.
+#define PROP_COLLECTORS "debug.TQ.collectors"
+// "SECONDS.NANOS": the wall-clock time at which the boot clock read zero, set at
+// every run start and folder switch, so that the run's properties dump lets a
+// reader give the kernel's lines (timed since boot) their wall-clock time.
+#define PROP_BOOT_WALLCLOCK "debug.TQ.boot_wallclock"
 
 // Peers allowed on the control socket besides the daemon's own user.
 constexpr int CONTROL_UID_ROOT = 0;

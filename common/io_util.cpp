@@ -39,7 +39,7 @@ char* read_all(int fd, size_t cap, size_t* len, bool* cut) {
         if (used == size) {
             if (size >= cap) {
                 char probe;
-                *cut = RETRY_EINTR(read(fd, &probe, 1)) > 0;
+                *cut = TEMP_FAILURE_RETRY(read(fd, &probe, 1)) > 0;
                 break;
             }
             size = size * 2 > cap ? cap : size * 2;
@@ -50,7 +50,7 @@ char* read_all(int fd, size_t cap, size_t* len, bool* cut) {
             }
             buf = bigger;
         }
-        ssize_t n = RETRY_EINTR(read(fd, buf + used, size - used));
+        ssize_t n = TEMP_FAILURE_RETRY(read(fd, buf + used, size - used));
         if (n < 0) {
             free(buf);
             return nullptr;

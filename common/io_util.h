@@ -1,18 +1,11 @@
-// Small I/O helpers: retry EINTR, complete short writes.
+// Small I/O helpers: complete short writes, read whole files. Calls that a
+// signal can interrupt are retried with TEMP_FAILURE_RETRY of <unistd.h>.
 #pragma once
 
 #include <errno.h>
 #include <stddef.h>
 #include <sys/types.h>
-
-#define RETRY_EINTR(exp)                                  \
-    ({                                                    \
-        decltype(exp) retry_rc_;                          \
-        do {                                              \
-            retry_rc_ = (exp);                            \
-        } while (retry_rc_ == -1 && errno == EINTR);      \
-        retry_rc_;                                        \
-    })
+#include <unistd.h>
 
 // Writes all len bytes unless an error other than EINTR occurs. Returns the
 // number of bytes written (len on success) or -1 when nothing could be written.

@@ -3,6 +3,9 @@
 
 constexpr int LOG_TYPE_COUNT = 5;
 
+// Abstract-namespace local socket from the collectors to the transist.
+#define LOG_SOCKET_NAME "log_socket"
+
 enum LogTypeIndex { LOG_MAIN = 0, LOG_RADIO = 1, LOG_EVENTS = 2, LOG_KERNEL = 3, LOG_BT = 4 };
 
 // Stream letter a collector sends first on "log_socket".

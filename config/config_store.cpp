@@ -10,11 +10,13 @@
 #include "common/io_util.h"
 #include "common/limits.h"
 #include "common/unique_fd.h"
-#include "common/wlog.h"
 #include "config/log_path.h"
 #include "platform/properties.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 #include "storage/safe_file.h"
+
+// The resolved logpath is kept in a configuration field.
+static_assert(LOG_PATH_VALUE_MAX == CONFIG_FIELD_LEN, "a logpath value is a configuration value");
 
 namespace {
 
@@ -49,7 +51,7 @@ class LineReader {
         size_t n = 0;
         while (n < READ_PIECE_LEN) {
             if (pos_ == len_) {
-                ssize_t r = RETRY_EINTR(read(fd_, buf_, sizeof(buf_)));
+                ssize_t r = TEMP_FAILURE_RETRY(read(fd_, buf_, sizeof(buf_)));
                 if (r < 0 && n == 0) return -1;
                 if (r <= 0) break;
                 pos_ = 0;
@@ -82,7 +84,7 @@ ConfigItem* find_item(ConfigCache* cache, const char* key) {
 int open_for_reading(const char* path) {
     const char* root = trusted_root_of(path, nullptr);
     if (root != nullptr) return safe_open_path_file(root, path, SAFE_READ, 0);
-    return RETRY_EINTR(open(path, O_RDONLY | O_CLOEXEC));
+    return TEMP_FAILURE_RETRY(open(path, O_RDONLY | O_CLOEXEC));
 }
 
 }  // namespace
@@ -166,9 +168,22 @@ int config_read_system_defaults(ConfigCache* cache) {
     return config_read_file(cache, SYSTEM_DEFAULTS_FILE);
 }
 
+// Replaces the stored logpath with persist.qrvlog.log2sd.path when that is set
+// and differs; rewrites the configuration file then.
+static void apply_log_path_override(ConfigCache* cache) {
+    char override_path[PROPERTY_VALUE_MAX];
+    property_get("persist.qrvlog.log2sd.path", override_path, "");
+    if (override_path[0] == '\0') return;
+    // config_update_item reports 0 when the value is already the stored one.
+    if (config_update_item(cache, "logpath", override_path) == 0) return;
+    WLOG(TAG_CONFIG, WLOG_DEBUG, "new log path is %s", override_path);
+    config_write(cache);
+}
+
 int config_load(ConfigCache* cache) {
     int rc = 0;
     if (config_read_file(cache, CONFIG_FILE) == 0) {
+        // "some thing" as stored histories and tools have it.
         HLOG(TAG_CONFIG, WLOG_ERROR, "some thing wrong when read %s,recreate a new one", CONFIG_FILE);
         if (config_write(cache) < 0) rc = -1;
     }
@@ -183,6 +198,7 @@ int config_write(const ConfigCache* cache) {
     int fd = dir.ok() ? safe_replace_begin(dir.get(), CONFIG_NAME, CONFIG_FILE_MODE) : -1;
     if (fd < 0) {
         int err = errno;
+        // "cant" as stored histories and tools have it.
         HLOG(TAG_CONFIG, WLOG_ERROR, "cant open the config file,errno=%d,%s", err, strerror(err));
         return -1;
     }
@@ -196,6 +212,7 @@ int config_write(const ConfigCache* cache) {
             int err = errno;
             // The record names the item without its line feed: one record, one line.
             if (len > 0 && len < static_cast<int>(sizeof(line))) line[len - 1] = '\0';
+            // "erron" as stored histories and tools have it.
             HLOG(TAG_CONFIG, WLOG_ERROR, "write %s to configure file failed,erron:%d", line, err);
             // The old file stays in place rather than be replaced by an incomplete one.
             safe_replace_abort(dir.get(), CONFIG_NAME, fd);
@@ -205,6 +222,7 @@ int config_write(const ConfigCache* cache) {
     }
     if (safe_replace_commit(dir.get(), CONFIG_NAME, fd) != 0) {
         int err = errno;
+        // "erron" as stored histories and tools have it.
         HLOG(TAG_CONFIG, WLOG_ERROR, "write %s to configure file failed,erron:%d", CONFIG_FILE, err);
         return -1;
     }

@@ -3,10 +3,8 @@
 #include <string.h>
 
 #include "common/io_util.h"
-#include "common/wlog.h"
-#include "config/config_store.h"
 #include "platform/properties.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 #include "storage/safe_file.h"
 
 namespace {
@@ -16,7 +14,7 @@ bool is_symbolic_name(const char* value) {
 }
 
 bool is_clean_absolute_path(const char* path) {
-    if (path[0] != '/' || strlen(path) >= static_cast<size_t>(CONFIG_FIELD_LEN)) return false;
+    if (path[0] != '/' || strlen(path) >= static_cast<size_t>(LOG_PATH_VALUE_MAX)) return false;
     for (const char* at = path; *at != '\0';) {
         while (*at == '/') at++;
         size_t len = strcspn(at, "/");
@@ -55,10 +53,11 @@ void storage_dir(const char* property, const char* fallback, char* out) {
     char dir[PROPERTY_VALUE_MAX];
     property_get(property, dir, "");
     if (dir_fault(dir) != nullptr) {
+        // "cant" as stored histories and tools have it.
         HLOG(TAG_CONFIG, WLOG_ERROR, "cant get log path through property %s", property);
-        copy_str(out, CONFIG_FIELD_LEN, fallback);
+        copy_str(out, LOG_PATH_VALUE_MAX, fallback);
     } else {
-        copy_str(out, CONFIG_FIELD_LEN, dir);
+        copy_str(out, LOG_PATH_VALUE_MAX, dir);
     }
 }
 
@@ -84,18 +83,8 @@ const char* resolve_log_path(const char* value, char* out) {
     } else if (strcmp(value, "external_sd") == 0) {
         storage_dir("external_sd_path", "/mnt/sdcard2", out);
     } else {
-        copy_str(out, CONFIG_FIELD_LEN, value);
+        copy_str(out, LOG_PATH_VALUE_MAX, value);
     }
     WLOG(TAG_CONFIG, WLOG_DEBUG, "correct log path is %s", out);
     return out;
-}
-
-void apply_log_path_override(ConfigCache* cache) {
-    char override_path[PROPERTY_VALUE_MAX];
-    property_get("persist.qrvlog.log2sd.path", override_path, "");
-    if (override_path[0] == '\0') return;
-    // config_update_item reports 0 when the value is already the stored one.
-    if (config_update_item(cache, "logpath", override_path) == 0) return;
-    WLOG(TAG_CONFIG, WLOG_DEBUG, "new log path is %s", override_path);
-    config_write(cache);
 }

@@ -2,7 +2,8 @@
 // persist.qrvlog.log2sd.path.
 #pragma once
 
-struct ConfigCache;
+// A logpath value or directory: at most 91 characters, as a configuration value.
+constexpr int LOG_PATH_VALUE_MAX = 92;
 
 // The longest directory usable as log path: a run folder below it adds 40
 // characters ("/qrvlog/tavlolog/APLog_YYYY_MMDD_HHMMSS/") and is published in
@@ -17,11 +18,7 @@ const char* log_path_value_fault(const char* value);
 // 1 when log_path_value_fault finds nothing.
 int log_path_value_valid(const char* value);
 
-// Writes the directory for a logpath value into out (CONFIG_FIELD_LEN bytes)
+// Writes the directory for a logpath value into out (LOG_PATH_VALUE_MAX bytes)
 // and returns out. A value that is not valid is recorded and resolved as
 // "internal_sd"; a storage property that is no usable directory counts as unset.
 const char* resolve_log_path(const char* value, char* out);
-
-// Replaces the stored logpath with persist.qrvlog.log2sd.path when that is set
-// and differs; rewrites the configuration file then. Part of config_load.
-void apply_log_path_override(ConfigCache* cache);

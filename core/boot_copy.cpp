@@ -9,13 +9,13 @@
 #include <time.h>
 #include <unistd.h>
 
+#include "common/clock.h"
 #include "common/io_util.h"
 #include "common/limits.h"
 #include "common/unique_fd.h"
-#include "common/wlog.h"
 #include "core/log_controller.h"
 #include "core/logging_run.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 #include "storage/log_copy.h"
 #include "storage/safe_file.h"
 
@@ -24,9 +24,11 @@ namespace {
 constexpr long long KELM_WAIT_US = 29999999;
 constexpr int KELM_RUN_MB = 300;
 
-bool exists(const char* path) {
-    struct stat st;
-    return lstat(path, &st) == 0;
+// What a copy of held logs needs of the controller, as it stands now.
+HeldCopy held_copy(LogController* controller) {
+    HeldCopy copy = {controller->logpath, {}, controller->data_storage_low != 0, &controller->warned};
+    for (int type = 0; type < LOG_TYPE_COUNT; type++) copy.enabled[type] = controller->log_on[type] != 0;
+    return copy;
 }
 
 // Removes the folder name of /data (or of parent below it) if it is empty: a
@@ -34,12 +36,6 @@ bool exists(const char* path) {
 void remove_if_empty(const char* parent, const char* name) {
     UniqueFd dir(safe_open_dir("/data", parent, false, 0));
     if (dir.ok()) safe_remove_dir(dir.get(), name);
-}
-
-long long monotonic_us() {
-    struct timespec ts;
-    clock_gettime(CLOCK_MONOTONIC, &ts);
-    return static_cast<long long>(ts.tv_sec) * 1000000 + ts.tv_nsec / 1000;
 }
 
 // The folders of the other boots, oldest boot first: their logs are appended
@@ -85,7 +81,7 @@ bool copy_other_modes(LogController* controller) {
     for (int i = 0; i < folders.count; i++) {
         char folder[PATH_LEN];
         snprintf(folder, sizeof(folder), "%s%s/", OTHER_MODE_FOLDER, folders.entries[i].name);
-        CopyResult rc = copy_log_folder(controller, folder, controller->run_folder, ".otherboot");
+        CopyResult rc = copy_log_folder(held_copy(controller), folder, controller->run_folder, ".otherboot");
         remove_if_empty(OTHER_MODE_FOLDER, folders.entries[i].name);
         if (rc == COPY_ABORT) return false;
     }
@@ -113,13 +109,13 @@ void copy_saved_logs(LogController* controller) {
                 {TEMP_FOLDER, "log_temp", ".boot"},
                 {HBR_FOLDER, "log_hbr", ".hbr"}};
     for (const auto& h : held) {
-        if (!exists(h.folder)) continue;
-        CopyResult rc = copy_log_folder(controller, h.folder, controller->run_folder, h.suffix);
+        if (!path_exists(h.folder)) continue;
+        CopyResult rc = copy_log_folder(held_copy(controller), h.folder, controller->run_folder, h.suffix);
         remove_if_empty("/data/", h.name);
         if (rc == COPY_ABORT) return;
         sleep(1);
     }
-    if (exists(OTHER_MODE_FOLDER)) copy_other_modes(controller);
+    if (path_exists(OTHER_MODE_FOLDER)) copy_other_modes(controller);
 }
 
 int boot_fail_copy(LogController* controller) {
@@ -139,11 +135,11 @@ int boot_fail_copy(LogController* controller) {
         return -1;
     }
     CopyResult rc = COPY_DONE;
-    if (exists(PREV_BOOT_FOLDER)) {
-        rc = copy_log_folder(controller, PREV_BOOT_FOLDER, controller->run_folder, ".prev_boot");
+    if (path_exists(PREV_BOOT_FOLDER)) {
+        rc = copy_log_folder(held_copy(controller), PREV_BOOT_FOLDER, controller->run_folder, ".prev_boot");
         remove_if_empty("/data/", "log_temp_prev");
     }
-    if (rc != COPY_ABORT) rc = copy_log_folder(controller, TEMP_FOLDER, controller->run_folder, ".boot");
+    if (rc != COPY_ABORT) rc = copy_log_folder(held_copy(controller), TEMP_FOLDER, controller->run_folder, ".boot");
     WLOG(TAG_MAIN, WLOG_DEBUG, "Delete '%s'.", TEMP_FOLDER);
     remove_if_empty("/data/", "log_temp");
     // A card that failed during the copy is no complete copy.
@@ -182,8 +178,8 @@ void kelm_mode_copy(LogController* controller) {
         controller->rotate_size_kb = calc_rotate_size(controller, KELM_RUN_MB);
         switch_run_folder(controller, controller->run_folder);
         // On the card now: the writer checks the card's free space, not /data's.
-        controller->log_path_state = 1;
-        copy_log_folder(controller, held, controller->run_folder, ".kelm_boot");
+        controller->log_path_state = LOG_PATH_UNDER_LOGPATH;
+        copy_log_folder(held_copy(controller), held, controller->run_folder, ".kelm_boot");
         return;
     }
 }

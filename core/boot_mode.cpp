@@ -5,11 +5,10 @@
 #include <unistd.h>
 
 #include "common/io_util.h"
-#include "common/wlog.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 
 int read_boot_mode(const char* path) {
-    int fd = RETRY_EINTR(open(path, O_RDONLY | O_CLOEXEC));
+    int fd = TEMP_FAILURE_RETRY(open(path, O_RDONLY | O_CLOEXEC));
     if (fd < 0) {
         HLOG(TAG_DEBUG, WLOG_ERROR, "Failed to open boot mode file %s", path);
         return -1;
@@ -17,7 +16,7 @@ int read_boot_mode(const char* path) {
     // Only the first character counts: "10" is boot mode 1. A little more is read
     // so that odd content can be recorded.
     char content[8] = {};
-    ssize_t n = RETRY_EINTR(read(fd, content, sizeof(content)));
+    ssize_t n = TEMP_FAILURE_RETRY(read(fd, content, sizeof(content)));
     close(fd);
     if (n < 0) n = 0;
     char buf[2] = {content[0], 0};

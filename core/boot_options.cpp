@@ -5,10 +5,9 @@
 #include <string.h>
 
 #include "common/io_util.h"
-#include "common/wlog.h"
 #include "config/config_store.h"
 #include "core/log_controller.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 
 int logsize_from(const char* value) {
     // A number and nothing else (a stored value may end in "\r" or a tab).
@@ -29,7 +28,7 @@ void LogController::load_boot_options(ConfigCache& config) {
     sd_log_path = 1;
     log_file_num = 0;
     memset(logpath, 0, sizeof(logpath));
-    // android_log, kernel_log and bt_log keep their value when the key is missing.
+    // The log switches keep their value when the key is missing.
 
     const char* value;
     if ((value = config_get(&config, "autostart"))) autostart = atoi(value);
@@ -40,18 +39,18 @@ void LogController::load_boot_options(ConfigCache& config) {
     if ((value = config_get(&config, "logsize"))) logsize = logsize_from(value);
     if ((value = config_get(&config, "totallogsize"))) totallogsize = atoi(value);
     if ((value = config_get(&config, "AndroidLog"))) {
-        android_log = atoi(value);
-        if (android_log) log_file_num += 15;
+        log_on[LOG_MAIN] = log_on[LOG_RADIO] = log_on[LOG_EVENTS] = atoi(value);
+        if (log_on[LOG_MAIN]) log_file_num += 15;
     }
     if ((value = config_get(&config, "KernelLog"))) {
-        kernel_log = atoi(value);
-        if (kernel_log) log_file_num += 5;
+        log_on[LOG_KERNEL] = atoi(value);
+        if (log_on[LOG_KERNEL]) log_file_num += 5;
     }
     WLOG(TAG_MAIN, WLOG_DEBUG, "have qrvbt");
     if ((value = config_get(&config, "BTLog"))) {
-        bt_log = atoi(value);
-        if (bt_log) log_file_num += 5;
+        log_on[LOG_BT] = atoi(value);
+        if (log_on[LOG_BT]) log_file_num += 5;
     }
     HLOG(TAG_MAIN, WLOG_INFO, "boot:%d,path:%s,size:%d,Tsize:%d,A:%d,K:%d,B:%d", autostart, logpath,
-         logsize, totallogsize, android_log, kernel_log, bt_log);
+         logsize, totallogsize, log_on[LOG_MAIN], log_on[LOG_KERNEL], log_on[LOG_BT]);
 }

@@ -13,14 +13,13 @@
 #include "common/io_util.h"
 #include "common/limits.h"
 #include "common/unique_fd.h"
-#include "common/wlog.h"
 #include "config/config_store.h"
 #include "core/boot_copy.h"
 #include "core/control_socket.h"
 #include "core/log_controller.h"
 #include "core/logging_run.h"
 #include "platform/properties.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 #include "storage/safe_file.h"
 #include "storage/storage_check.h"
 
@@ -33,11 +32,6 @@ constexpr char KELM_LOG_PATH[] = "/data/ext_sdcard_tool";
 // The room a boot's holding folder needs on /data: its whole run, and the
 // reserve below which /data counts as low and the run stops.
 constexpr uint64_t HOLDING_ROOM_BYTES = (static_cast<uint64_t>(BOOT_RUN_MB) << 20) + LOW_STORAGE_BYTES;
-
-bool exists(const char* path) {
-    struct stat st;
-    return lstat(path, &st) == 0;
-}
 
 // Set by the first daemon of a boot once its folder is made; gone at reboot.
 bool restarted_in_this_boot() {
@@ -117,8 +111,8 @@ void load_config(ConfigCache* config) {
 
 // The kelm and other boots record without the Bluetooth stack's log.
 void bluetooth_off(LogController* controller) {
-    if (!controller->bt_log) return;
-    controller->bt_log = 0;
+    if (!controller->log_on[LOG_BT]) return;
+    controller->log_on[LOG_BT] = 0;
     controller->log_file_num -= 5;
 }
 
@@ -139,15 +133,16 @@ void normal_boot(LogController* controller, ConfigCache* config) {
     }
     if (controller->sd_log_path) {
         if (!start_in_temp_folder(controller)) return;
-        if (data_storage_low == 1) {
+        if (controller->data_storage_low == 1) {
+            // "dont" as stored histories and tools have it.
             HLOG(TAG_MAIN, WLOG_ERROR, "/data is low, dont start children process(2)");
-            controller->log_path_state = 1;
+            controller->log_path_state = LOG_PATH_UNDER_LOGPATH;
             return;
         }
     } else {
         compose_run_folder(controller);
         if (create_run_folder(controller, controller->logpath, controller->run_folder) < 0) return;
-        controller->log_path_state = 1;
+        controller->log_path_state = LOG_PATH_UNDER_LOGPATH;
     }
     start_boot_run(controller, BOOT_RUN_MB);
 }
@@ -158,7 +153,8 @@ void kelm_boot(LogController* controller, ConfigCache* config) {
     copy_str(controller->logpath, sizeof(controller->logpath), KELM_LOG_PATH);
     controller->boot_copy_timer = 0;
     if (!start_in_temp_folder(controller)) return;
-    if (data_storage_low == 1) {
+    if (controller->data_storage_low == 1) {
+        // "dont" as stored histories and tools have it.
         HLOG(TAG_MAIN, WLOG_ERROR, "/data is low, dont start tqlog");
         return;
     }
@@ -220,7 +216,7 @@ void prune_other_modes(int dir, BootNumbers* numbers) {
 // boots, whose two newest folders are kept. A daemon restarted within the boot
 // goes on in its boot's folder and removes nothing. -1 when they cannot be listed.
 int next_other_mode_number(bool restarted) {
-    if (!exists(OTHER_MODE_FOLDER)) return 1;
+    if (!path_exists(OTHER_MODE_FOLDER)) return 1;
     BootNumbers numbers;
     UniqueFd dir(safe_open_dir("/data", OTHER_MODE_FOLDER, false, 0));
     if (!dir.ok() || safe_list_dir(dir.get(), collect_boot_number, &numbers) < 0) {
@@ -261,27 +257,28 @@ void other_boot(LogController* controller, ConfigCache* config) {
 }  // namespace
 
 int start_in_temp_folder(LogController* controller) {
-    controller->log_path_state = 0;
+    controller->log_path_state = LOG_PATH_HELD_IN_DATA;
     if (controller->boot_mode == 0) controller->boot_copy_timer = 1;
     copy_str(controller->run_folder, sizeof(controller->run_folder), TEMP_FOLDER);
     WLOG(TAG_MAIN, WLOG_DEBUG, "save log to temp file %s", TEMP_FOLDER);
     if (is_storage_low("/data")) {
-        data_storage_low = 1;
+        controller->data_storage_low = 1;
         return 1;
     }
-    data_storage_low = 0;
+    controller->data_storage_low = 0;
     remove_stray("log_temp");
     // What this boot's earlier daemon held there is appended to.
     if (restarted_in_this_boot()) {
-        if (exists(TEMP_FOLDER)) HLOG(TAG_MAIN, WLOG_ERROR, "restarted within this boot, %s kept", TEMP_FOLDER);
+        if (path_exists(TEMP_FOLDER)) HLOG(TAG_MAIN, WLOG_ERROR, "restarted within this boot, %s kept", TEMP_FOLDER);
     } else {
         keep_previous_boot();
     }
     if (create_run_folder(controller, "/data", TEMP_FOLDER) < 0) {
         int err = errno;
+        // "faild" as stored histories and tools have it.
         HLOG(TAG_MAIN, WLOG_ERROR, "mkdir %s faild,errno=%d", TEMP_FOLDER, err);
         // With nothing held the boot-copy wait would only make an empty folder on the card.
-        if (!exists(PREV_BOOT_FOLDER)) controller->boot_copy_timer = 0;
+        if (!path_exists(PREV_BOOT_FOLDER)) controller->boot_copy_timer = 0;
         return 0;
     }
     property_set(PROP_BOOTED, "1");
@@ -290,7 +287,7 @@ int start_in_temp_folder(LogController* controller) {
 
 void boot_start(LogController* controller, int boot_mode) {
     controller->boot_mode = boot_mode;
-    history_log(0, "boot mode: %d", boot_mode);
+    record_history(0, "boot mode: %d", boot_mode);
     WLOG(TAG_MAIN, WLOG_INFO, "boot mode: %d", boot_mode);
     {
         ConfigCache config;

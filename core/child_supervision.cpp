@@ -8,19 +8,25 @@
 #include <unistd.h>
 
 #include "collectors/control_block.h"
-#include "common/wlog.h"
+#include "common/control_protocol.h"
 #include "core/control_socket.h"
 #include "core/log_controller.h"
 #include "core/logging_run.h"
-#include "storage/history_log.h"
+#include "core/reply_client.h"
+#include "record/record.h"
 #include "storage/storage_check.h"
+
+// The controller's efd_chld: the handler cannot be told which controller runs.
+static int sigchld_notice_fd = -1;
+
+void set_sigchld_notice(int efd_chld) { sigchld_notice_fd = efd_chld; }
 
 // May run on any thread, in the middle of anything: only the eventfd write,
 // which wakes the control thread. The reaping and the records happen there.
 void sigchld_handler(int) {
     int saved = errno;
     uint64_t one = 1;
-    ssize_t rc = write(efd_chld, &one, sizeof(one));
+    ssize_t rc = write(sigchld_notice_fd, &one, sizeof(one));
     (void)rc;
     errno = saved;
 }
@@ -31,8 +37,10 @@ static int32_t slot_reason(const LogController* controller, int slot) {
 }
 
 static bool all_pids_clear(const LogController* controller) {
-    return controller->klog_pid == 0 && controller->mlog_pid == 0 && controller->rlog_pid == 0 &&
-           controller->elog_pid == 0 && controller->blog_pid == 0;
+    for (pid_t pid : controller->collector_pid) {
+        if (pid != 0) return false;
+    }
+    return true;
 }
 
 // One dead collector: its record, the check's one warning, its pid cleared.
@@ -62,32 +70,28 @@ void check_children(LogController* controller) {
     }
     controller->warned = 0;
 
-    if (controller->kernel_log && controller->klog_pid != 0 && is_dead(controller->klog_pid)) {
-        HLOG(TAG_MAIN, WLOG_ERROR, "kLog dies unexpectly");
-        note_death(controller, &controller->klog_pid, SLOT_KERNEL);
-    }
-    if (controller->android_log && controller->mlog_pid != 0 && is_dead(controller->mlog_pid)) {
-        HLOG(TAG_MAIN, WLOG_ERROR, "mLog dies unexpectly");
-        note_death(controller, &controller->mlog_pid, SLOT_MAIN);
-    }
-    if (controller->android_log && controller->rlog_pid != 0 && is_dead(controller->rlog_pid)) {
-        HLOG(TAG_MAIN, WLOG_ERROR, "rLog dies unexpectly");
-        note_death(controller, &controller->rlog_pid, SLOT_RADIO);
-    }
-    if (controller->android_log && controller->elog_pid != 0 && is_dead(controller->elog_pid)) {
-        HLOG(TAG_MAIN, WLOG_ERROR, "eLog dies unexpectly");
-        note_death(controller, &controller->elog_pid, SLOT_EVENTS);
-    }
-    if (controller->bt_log && controller->blog_pid != 0 && is_dead(controller->blog_pid)) {
-        HLOG(TAG_MAIN, WLOG_ERROR, "bLog dies unexpectly");
-        note_death(controller, &controller->blog_pid, SLOT_BT);
+    // Checked in this order, kernel first, as the history has always shown them.
+    static const int order[LOG_TYPE_COUNT] = {LOG_KERNEL, LOG_MAIN, LOG_RADIO, LOG_EVENTS, LOG_BT};
+    for (int type : order) {
+        pid_t* pid = &controller->collector_pid[type];
+        if (!controller->log_on[type] || *pid == 0 || !is_dead(*pid)) continue;
+        // "dies unexpectly" as stored histories and tools have it.
+        switch (type) {
+            case LOG_KERNEL: HLOG(TAG_MAIN, WLOG_ERROR, "kLog dies unexpectly"); break;
+            case LOG_MAIN: HLOG(TAG_MAIN, WLOG_ERROR, "mLog dies unexpectly"); break;
+            case LOG_RADIO: HLOG(TAG_MAIN, WLOG_ERROR, "rLog dies unexpectly"); break;
+            case LOG_EVENTS: HLOG(TAG_MAIN, WLOG_ERROR, "eLog dies unexpectly"); break;
+            default: HLOG(TAG_MAIN, WLOG_ERROR, "bLog dies unexpectly"); break;
+        }
+        note_death(controller, pid, control_slot_of(type));
     }
 
     // A death is otherwise silent while the others go on: it shows in the property.
     publish_collectors(controller);
     if (all_pids_clear(controller)) {
+        // "chil" as stored histories and tools have it.
         HLOG(TAG_MAIN, WLOG_ERROR, "all chil processes die");
-        reply_client(controller, -1, "tqlog_stopped");
+        reply_client(controller, -1, BROADCAST_STOPPED);
         stop_logging(controller);
     }
 }

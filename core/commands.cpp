@@ -8,7 +8,6 @@
 
 #include "common/control_protocol.h"
 #include "common/io_util.h"
-#include "common/wlog.h"
 #include "config/config_store.h"
 #include "config/log_path.h"
 #include "core/boot_copy.h"
@@ -16,9 +15,10 @@
 #include "core/control_socket.h"
 #include "core/log_controller.h"
 #include "core/logging_run.h"
+#include "core/reply_client.h"
 #include "platform/properties.h"
+#include "record/record.h"
 #include "storage/debug_dump.h"
-#include "storage/history_log.h"
 #include "transist/transist.h"
 
 // Size in MB of the run that carries logging through a fast power-off.
@@ -111,7 +111,7 @@ static int cmd_deep_start(LogController* controller, int fd) {
     copy_saved_logs(controller);
     char autostart_on[] = "autostart=1";
     apply_config_message(controller, autostart_on);
-    controller->log_path_state = 1;
+    controller->log_path_state = LOG_PATH_UNDER_LOGPATH;
     return 1;
 }
 
@@ -152,7 +152,7 @@ static int move_run_to_log_path(LogController* controller, int fd) {
     }
     controller->rotate_size_kb = calc_rotate_size(controller, controller->logsize);
     switch_run_folder(controller, controller->run_folder);
-    controller->log_path_state = 1;
+    controller->log_path_state = LOG_PATH_UNDER_LOGPATH;
     reply_word(controller, fd, CMD_COPY, REPLY_DONE);
     copy_saved_logs(controller);
     dump_into_run_folder(controller);
@@ -161,7 +161,8 @@ static int move_run_to_log_path(LogController* controller, int fd) {
 
 static int cmd_copy(LogController* controller, int fd) {
     if (run_live(controller)) {
-        if (controller->log_path_state == 1) {
+        if (controller->log_path_state == LOG_PATH_UNDER_LOGPATH) {
+            // "copyed" as stored histories and tools have it.
             HLOG(TAG_MAIN, WLOG_ERROR, "has copyed to sd,ignore this 'copy'");
             reply_word(controller, fd, CMD_COPY, REPLY_DONE);
             return 1;
@@ -204,7 +205,7 @@ static int cmd_hbr_shutdown(LogController* controller, int fd) {
         reply_word(controller, fd, CMD_HBR_SHUTDOWN, REPLY_FAILED);
         return 0;
     }
-    controller->log_path_state = 0;
+    controller->log_path_state = LOG_PATH_HELD_IN_DATA;
     controller->rotate_size_kb = calc_rotate_size(controller, HBR_LOG_MB);
     switch_run_folder(controller, HBR_FOLDER);
     reply_word(controller, fd, CMD_HBR_SHUTDOWN, REPLY_DONE);
@@ -216,7 +217,7 @@ static int cmd_hbr_shutdown(LogController* controller, int fd) {
 int handle_client_message(LogController* controller, int fd) {
     // One spare byte so that the text is terminated even when the read is full.
     char message[CONTROL_MSG_MAX + 1] = {};
-    ssize_t n = RETRY_EINTR(read(fd, message, CONTROL_MSG_MAX));
+    ssize_t n = TEMP_FAILURE_RETRY(read(fd, message, CONTROL_MSG_MAX));
     if (n < 0) {
         // Nothing there after all (the socket is non-blocking): keep the client.
         if (errno == EAGAIN || errno == EWOULDBLOCK) return 1;

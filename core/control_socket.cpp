@@ -17,16 +17,17 @@
 
 #include <cutils/sockets.h>
 
+#include "common/clock.h"
 #include "common/control_protocol.h"
 #include "common/io_util.h"
-#include "common/wlog.h"
 #include "core/boot_copy.h"
 #include "core/child_supervision.h"
 #include "core/client_table.h"
+#include "core/fatal.h"
 #include "core/log_controller.h"
 #include "core/logging_run.h"
 #include "core/peer_auth.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 #include "storage/storage_check.h"
 
 time_t boot_copy_timeout_s = BOOT_COPY_TIMEOUT_S;
@@ -84,9 +85,10 @@ void start_control_socket(LogController* controller) {
     pthread_t thread;
     int rc = pthread_create(&thread, nullptr, control_thread, controller);
     if (rc != 0) {
+        // "deamon" as stored histories and tools have it.
         HLOG(TAG_MAIN, WLOG_ERROR, "create deamon thread failed(%s)", strerror(rc));
         report_system_warning(3);
-        exit(-1);
+        daemon_exit(-1);
     }
     // Never joined: the thread lives as long as the process.
     pthread_detach(thread);
@@ -111,7 +113,7 @@ static int accept_client(LogController* controller) {
     socklen_t addr_len = sizeof(addr);
     // Non-blocking: a client that connects and then misbehaves must not be
     // able to stall the only event loop. CLOEXEC: see start_control_socket.
-    int fd = RETRY_EINTR(accept4(controller->listen_fd, reinterpret_cast<sockaddr*>(addr),
+    int fd = TEMP_FAILURE_RETRY(accept4(controller->listen_fd, reinterpret_cast<sockaddr*>(addr),
                                  &addr_len, SOCK_CLOEXEC | SOCK_NONBLOCK));
     if (fd < 0) {
         HLOG(TAG_MAIN, WLOG_ERROR, "accept failed %s(%d)", strerror(errno), errno);
@@ -174,14 +176,8 @@ static void serve_clients(LogController* controller, fd_set* readable) {
 // Reads an eventfd counter; 0 when there was nothing to read.
 static unsigned long long read_counter(int fd) {
     uint64_t value = 0;
-    if (RETRY_EINTR(read(fd, &value, sizeof(value))) != sizeof(value)) return 0;
+    if (TEMP_FAILURE_RETRY(read(fd, &value, sizeof(value))) != sizeof(value)) return 0;
     return value;
-}
-
-static long long now_ms() {
-    struct timespec ts;
-    clock_gettime(CLOCK_MONOTONIC, &ts);
-    return static_cast<long long>(ts.tv_sec) * 1000 + ts.tv_nsec / 1000000;
 }
 
 static void keep_earliest(long long* wait_ms, long long ms) {
@@ -197,29 +193,29 @@ static void watch(fd_set* set, int fd, int* max_fd) {
 void control_loop(LogController* controller) {
     // The time-out counts from the start of the loop: any event disarms it,
     // so until then all the time was spent waiting.
-    const long long boot_copy_deadline = now_ms() + static_cast<long long>(boot_copy_timeout_s) * 1000;
-    long long next_bind_try = now_ms() + CONTROL_RETRY_MS;
+    const long long boot_copy_deadline = monotonic_ms() + static_cast<long long>(boot_copy_timeout_s) * 1000;
+    long long next_bind_try = monotonic_ms() + CONTROL_RETRY_MS;
     int bind_retries = 0;
 
     for (;;) {
-        if (controller->listen_fd < 0 && now_ms() >= next_bind_try) {
+        if (controller->listen_fd < 0 && monotonic_ms() >= next_bind_try) {
             retry_control_socket(controller, &bind_retries);
-            next_bind_try = now_ms() + CONTROL_RETRY_MS;
+            next_bind_try = monotonic_ms() + CONTROL_RETRY_MS;
         }
         fd_set readable;
         FD_ZERO(&readable);
         int max_fd = -1;
         if (controller->listen_fd >= 0) watch(&readable, controller->listen_fd, &max_fd);
-        if (efd_chld > 0) watch(&readable, efd_chld, &max_fd);
-        if (efd_thread > 0) watch(&readable, efd_thread, &max_fd);
+        if (controller->efd_chld > 0) watch(&readable, controller->efd_chld, &max_fd);
+        if (controller->efd_thread > 0) watch(&readable, controller->efd_thread, &max_fd);
         // Only this thread changes the slots, so they can be read without the lock.
         for (const ClientSlot& slot : controller->clients) {
             if (slot.fd >= 0) watch(&readable, slot.fd, &max_fd);
         }
 
         long long wait_ms = -1;
-        if (controller->boot_copy_timer) keep_earliest(&wait_ms, boot_copy_deadline - now_ms());
-        if (controller->listen_fd < 0) keep_earliest(&wait_ms, next_bind_try - now_ms());
+        if (controller->boot_copy_timer) keep_earliest(&wait_ms, boot_copy_deadline - monotonic_ms());
+        if (controller->listen_fd < 0) keep_earliest(&wait_ms, next_bind_try - monotonic_ms());
         int flush_ms = peer_records_flush();
         if (flush_ms >= 0) keep_earliest(&wait_ms, flush_ms);
         struct timeval timeout = {static_cast<time_t>(wait_ms / 1000),
@@ -236,7 +232,7 @@ void control_loop(LogController* controller) {
         }
         if (ready == 0) {
             // Other waits (a retry, a record summary) end here too.
-            if (!controller->boot_copy_timer || now_ms() < boot_copy_deadline) continue;
+            if (!controller->boot_copy_timer || monotonic_ms() < boot_copy_deadline) continue;
             HLOG(TAG_MAIN, WLOG_ERROR, "select() timeout");
             controller->boot_copy_timer = 0;
             if (boot_fail_copy(controller) < 0) {
@@ -263,23 +259,21 @@ void control_loop(LogController* controller) {
 
         // Each counter is read once, before the record: HLOG evaluates its
         // arguments for the history and again for the platform log.
-        if (efd_chld > 0 && FD_ISSET(efd_chld, &readable)) {
-            unsigned long long deaths = read_counter(efd_chld);
+        if (controller->efd_chld > 0 && FD_ISSET(controller->efd_chld, &readable)) {
+            unsigned long long deaths = read_counter(controller->efd_chld);
             HLOG(TAG_MAIN, WLOG_INFO, "recv efd_chld %llu", deaths);
-            pid_t before[] = {controller->mlog_pid, controller->rlog_pid, controller->elog_pid,
-                              controller->klog_pid, controller->blog_pid};
+            pid_t before[LOG_TYPE_COUNT];
+            memcpy(before, controller->collector_pid, sizeof(before));
             check_children(controller);
-            pid_t after[] = {controller->mlog_pid, controller->rlog_pid, controller->elog_pid,
-                             controller->klog_pid, controller->blog_pid};
             // The daemon's own shell commands ("oru -m 3" as the boot run starts)
             // end too: only a collector's end tells that someone is there.
-            if (boot_copy_armed && ready == 1 && memcmp(before, after, sizeof(before)) == 0)
+            if (boot_copy_armed && ready == 1 && memcmp(before, controller->collector_pid, sizeof(before)) == 0)
                 controller->boot_copy_timer = 1;
         }
-        if (efd_thread > 0 && FD_ISSET(efd_thread, &readable)) {
-            // 1001 storage low, 1002 log folder lost (or their sum): either way the run ends.
+        if (controller->efd_thread > 0 && FD_ISSET(controller->efd_thread, &readable)) {
+            // EVENT_STORAGE_LOW, EVENT_FOLDER_LOST (or their sum): either way the run ends.
             // 0: a stop in this pass has already discarded what was there.
-            unsigned long long events = read_counter(efd_thread);
+            unsigned long long events = read_counter(controller->efd_thread);
             if (events != 0) {
                 HLOG(TAG_MAIN, WLOG_INFO, "recv efd_thread %llu", events);
                 stop_logging(controller);

@@ -5,20 +5,12 @@
 #include <string.h>
 #include <sys/eventfd.h>
 
-#include "common/wlog.h"
+#include "core/child_supervision.h"
 #include "platform/properties.h"
-#include "storage/history_log.h"
-
-int efd_chld = -1;
-int efd_thread = -1;
-int shm_fd = -1;
-int data_storage_low = 0;
+#include "record/record.h"
 
 LogController::LogController() {
     listen_fd = 0;
-    klog_pid = mlog_pid = rlog_pid = elog_pid = blog_pid = 0;
-    data_storage_low = 0;
-    log_path_state = -1;
     boot_copy_timer = 0;
     for (ClientSlot& slot : clients) {
         slot.fd = -1;
@@ -31,6 +23,7 @@ LogController::LogController() {
     // EFD_CLOEXEC keeps the counters out of the shell commands the daemon runs.
     efd_chld = eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC);
     if (efd_chld < 0) HLOG(TAG_MAIN, WLOG_ERROR, "create efd_chld failed(%s)", strerror(errno));
+    set_sigchld_notice(efd_chld);
     efd_thread = eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC);
     if (efd_thread < 0) HLOG(TAG_MAIN, WLOG_ERROR, "create efd_thread failed(%s)", strerror(errno));
 }
@@ -39,7 +32,7 @@ LogController::LogController() {
 LogController::~LogController() {}
 
 const char* LogController::current_log_root() const {
-    return log_path_state != 0 ? logpath : "/data";
+    return log_path_state.load() != LOG_PATH_HELD_IN_DATA ? logpath : "/data";
 }
 
 bool is_running() {

@@ -8,12 +8,23 @@
 #include <stdint.h>
 #include <sys/types.h>
 
+#include <atomic>
+
+#include "common/control_protocol.h"
 #include "common/limits.h"
+#include "common/log_types.h"
 
 struct ConfigCache;
 struct ControlBlock;
 
 constexpr int MAX_CLIENTS = 10;
+
+// Where the run's logs go, as far as the writer's free-space check is concerned.
+enum LogPathState {
+    LOG_PATH_UNKNOWN = -1,       // no run placed yet, or the run has ended
+    LOG_PATH_HELD_IN_DATA = 0,   // a holding folder in /data
+    LOG_PATH_UNDER_LOGPATH = 1,  // a run folder below the log path
+};
 
 struct ClientSlot {
     int fd;                 // -1 when the slot is free
@@ -32,23 +43,21 @@ class LogController {
     ControlBlock* shm = nullptr;
     sem_t* sem = nullptr;
     uint8_t boot_copy_timer = 0;
-    int android_log = 0;
-    int kernel_log = 0;
-    int bt_log = 0;
+    // The configured switch of each type's family (AndroidLog for main, radio
+    // and events; KernelLog; BTLog), by log type.
+    int log_on[LOG_TYPE_COUNT] = {};
     int listen_fd = 0;
     int warned = 0;
-    // -1 nothing known, 0 a temporary folder in /data, 1 a folder under the log path.
-    int log_path_state = -1;
+    // Written by the control thread during a copy or the kelm switch; read by
+    // the transist's writer through current_log_root.
+    std::atomic<LogPathState> log_path_state{LOG_PATH_UNKNOWN};
     // The daemon's own record of a live run, from start_logging to the end of
     // stop_logging. debug.TQ.running publishes it, but the shell can set that.
     bool run_active = false;
     pthread_mutex_t client_lock;  // guards clients; taken before reply_lock
     pthread_mutex_t reply_lock;   // serialises every write to clients
-    pid_t klog_pid = 0;
-    pid_t mlog_pid = 0;
-    pid_t rlog_pid = 0;
-    pid_t elog_pid = 0;
-    pid_t blog_pid = 0;
+    // The run's collector of each log type, 0 when none runs.
+    pid_t collector_pid[LOG_TYPE_COUNT] = {};
     int autostart = 0;
     int logsize = 0;
     int totallogsize = 0;
@@ -59,30 +68,16 @@ class LogController {
     char run_folder[PATH_LEN] = {};
     int boot_mode = 0;
     ClientSlot clients[MAX_CLIENTS];
+    // Non-blocking event counters: a collector ended (SIGCHLD), and the
+    // transist's writer gave up (EVENT_STORAGE_LOW, EVENT_FOLDER_LOST).
+    int efd_chld = -1;
+    int efd_thread = -1;
+    // Descriptor of the current run's shared control block; closed at stop.
+    int shm_fd = -1;
+    // 1 when the temporary-folder start found /data too full.
+    int data_storage_low = 0;
 };
 
-// Non-blocking event counters: a collector ended (SIGCHLD), and the transist's
-// writer gave up (1001 storage low, 1002 log folder lost).
-extern int efd_chld;
-extern int efd_thread;
-// Descriptor of the current run's shared control block; closed at stop.
-extern int shm_fd;
-// 1 when the temporary-folder start found /data too full.
-extern int data_storage_low;
-
-// "1" while a logging run is active; the one record of the running state.
-#define PROP_RUNNING "debug.TQ.running"
-#define PROP_REALPATH "debug.TQ.realpath"
-#define PROP_LOGSIZE "debug.TQ.logsize"
-// Which collectors of the run are alive, in the fixed order of the log types:
-// "main=up,radio=up,events=up,kernel=down,bt=off" (up: running; down: enabled
-// but ended, or never started; off: not enabled for this run); "" while no run
-// is active. Updated at run start, at each death and at stop.
-#define PROP_COLLECTORS "debug.TQ.collectors"
-// "SECONDS.NANOS": the wall-clock time at which the boot clock read zero, set at
-// every run start and folder switch, so that the run's properties dump lets a
-// reader give the kernel's lines (timed since boot) their wall-clock time.
-#define PROP_BOOT_WALLCLOCK "debug.TQ.boot_wallclock"
 // Set once a daemon of this boot has made /data/log_temp: a daemon restarted
 // by init finds the same boot's held logs there and keeps them.
 #define PROP_BOOTED "debug.TQ.booted"

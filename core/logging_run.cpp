@@ -20,17 +20,19 @@
 
 #include "collectors/collector_link.h"
 #include "collectors/control_block.h"
-#include "collectors/fork_collectors.h"
 #include "common/io_util.h"
 #include "common/unique_fd.h"
-#include "common/wlog.h"
 #include "config/log_path.h"
 #include "core/child_supervision.h"
+#include "core/fatal.h"
+#include "core/fork_collectors.h"
 #include "core/log_controller.h"
+#include "core/run_host.h"
 #include "platform/properties.h"
+#include "record/record.h"
 #include "storage/folder_records.h"
 #include "storage/history_log.h"
-#include "storage/record_limit.h"
+#include "record/record_limit.h"
 #include "storage/safe_file.h"
 #include "transist/transist.h"
 
@@ -80,7 +82,7 @@ static void remove_planted_links(const char* base, const char* folder) {
     int own_len = snprintf(own, sizeof(own), "%.*s" RUN_FOLDER_ROOT, static_cast<int>(base_len), base);
     if (own_len < 0 || own_len >= PATH_LEN || strncmp(folder, own, static_cast<size_t>(own_len)) != 0) return;
     // The base is trusted as it stands, links and all.
-    UniqueFd dir(RETRY_EINTR(open(base_len == 0 ? "/" : base, O_PATH | O_DIRECTORY | O_CLOEXEC)));
+    UniqueFd dir(TEMP_FAILURE_RETRY(open(base_len == 0 ? "/" : base, O_PATH | O_DIRECTORY | O_CLOEXEC)));
     size_t shown_len = base_len;
     static const char* const OWN_FOLDERS[] = {"qrvlog", "tavlolog"};
     for (const char* name : OWN_FOLDERS) {
@@ -98,7 +100,7 @@ static void remove_planted_links(const char* base, const char* folder) {
             }
             return;
         }
-        dir.reset(RETRY_EINTR(openat(dir.get(), name, O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC)));
+        dir.reset(TEMP_FAILURE_RETRY(openat(dir.get(), name, O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC)));
     }
 }
 
@@ -187,26 +189,22 @@ static void release_control_block(LogController* controller) {
 
 static void create_control_block(LogController* controller) {
     release_control_block(controller);
-    shm_fd = ashmem_create_region(CONTROL_BLOCK_NAME, CONTROL_BLOCK_SIZE);
-    if (shm_fd < 0) {
+    controller->shm_fd = ashmem_create_region(CONTROL_BLOCK_NAME, CONTROL_BLOCK_SIZE);
+    if (controller->shm_fd < 0) {
         int err = errno;
-        HLOG(TAG_MAIN, WLOG_ERROR, "ashmem create failed!errno:%s(%d)", strerror(err), err);
-        exit(1);
+        DAEMON_FATAL(1, TAG_MAIN, "ashmem create failed!errno:%s(%d)", strerror(err), err);
     }
-    void* map = mmap(nullptr, CONTROL_BLOCK_SIZE, PROT_READ | PROT_WRITE, MAP_SHARED, shm_fd, 0);
+    void* map = mmap(nullptr, CONTROL_BLOCK_SIZE, PROT_READ | PROT_WRITE, MAP_SHARED, controller->shm_fd, 0);
     if (map == MAP_FAILED) {
         int err = errno;
-        HLOG(TAG_MAIN, WLOG_ERROR, "mmap shared memory failed!errno:%s(%d)", strerror(err), err);
-        exit(1);
+        DAEMON_FATAL(1, TAG_MAIN, "mmap shared memory failed!errno:%s(%d)", strerror(err), err);
     }
     // Each run has a fresh region, so a collector of an earlier run that died
     // holding the semaphore cannot hold this one.
     ControlBlock* block = static_cast<ControlBlock*>(map);
     if (control_block_init(block) != 0) {
         int err = errno;
-        HLOG(TAG_MAIN, WLOG_ERROR, "sem_init %s failed!errno:%s(%d)", CONTROL_SEM_NAME, strerror(err),
-             err);
-        exit(1);
+        DAEMON_FATAL(1, TAG_MAIN, "sem_init %s failed!errno:%s(%d)", CONTROL_SEM_NAME, strerror(err), err);
     }
     controller->shm = block;
     controller->sem = control_sem(block);
@@ -214,22 +212,12 @@ static void create_control_block(LogController* controller) {
 }
 
 void publish_collectors(const LogController* controller) {
-    const struct {
-        const char* name;
-        int enabled;
-        pid_t pid;
-    } collectors[LOG_TYPE_COUNT] = {
-        {"main", controller->android_log, controller->mlog_pid},
-        {"radio", controller->android_log, controller->rlog_pid},
-        {"events", controller->android_log, controller->elog_pid},
-        {"kernel", controller->kernel_log, controller->klog_pid},
-        {"bt", controller->bt_log, controller->blog_pid},
-    };
+    static const char* const names[LOG_TYPE_COUNT] = {"main", "radio", "events", "kernel", "bt"};
     char value[PROPERTY_VALUE_MAX] = {};  // at most 52 characters
     size_t used = 0;
-    for (const auto& c : collectors) {
-        const char* state = !c.enabled ? "off" : c.pid != 0 ? "up" : "down";
-        int n = snprintf(value + used, sizeof(value) - used, "%s%s=%s", used ? "," : "", c.name, state);
+    for (int type = 0; type < LOG_TYPE_COUNT; type++) {
+        const char* state = !controller->log_on[type] ? "off" : controller->collector_pid[type] != 0 ? "up" : "down";
+        int n = snprintf(value + used, sizeof(value) - used, "%s%s=%s", used ? "," : "", names[type], state);
         if (n > 0) used += static_cast<size_t>(n);
     }
     property_set(PROP_COLLECTORS, value);
@@ -253,10 +241,13 @@ void start_logging(LogController* controller) {
     property_set(PROP_RUNNING, "1");
     controller->run_active = true;
 
-    transist_create(controller, controller->run_folder, controller->rotate_size_kb);
+    TransistRun run = {controller->run_folder, controller->logpath, {}, controller->rotate_size_kb};
+    for (int type = 0; type < LOG_TYPE_COUNT; type++) run.enabled[type] = controller->log_on[type] != 0;
+    transist_create(run_host(controller), run);
     create_control_block(controller);
 
-    if (controller->android_log) {
+    int shm_fd = controller->shm_fd;
+    if (controller->log_on[LOG_MAIN]) {
         fork_main_log(controller, shm_fd);
         fork_radio_log(controller, shm_fd);
         fork_events_log(controller, shm_fd);
@@ -265,19 +256,20 @@ void start_logging(LogController* controller) {
         mark_not_started(controller, SLOT_RADIO);
         mark_not_started(controller, SLOT_EVENTS);
     }
-    if (controller->kernel_log) {
+    if (controller->log_on[LOG_KERNEL]) {
         fork_kernel_log(controller, shm_fd);
     } else {
         mark_not_started(controller, SLOT_KERNEL);
     }
-    if (controller->bt_log) {
+    if (controller->log_on[LOG_BT]) {
         fork_bt_log(controller, shm_fd);
     } else {
         mark_not_started(controller, SLOT_BT);
     }
 
-    HLOG(TAG_MAIN, WLOG_INFO, "M(%d),R(%d),E(%d),K(%d),B(%d)", controller->mlog_pid,
-         controller->rlog_pid, controller->elog_pid, controller->klog_pid, controller->blog_pid);
+    const pid_t* pids = controller->collector_pid;
+    HLOG(TAG_MAIN, WLOG_INFO, "M(%d),R(%d),E(%d),K(%d),B(%d)", pids[LOG_MAIN], pids[LOG_RADIO],
+         pids[LOG_EVENTS], pids[LOG_KERNEL], pids[LOG_BT]);
     publish_collectors(controller);
 }
 
@@ -298,8 +290,8 @@ static bool child_gone(pid_t pid) {
 // SIGKILL to every collector still running, then wait (bounded) until they are
 // gone, so that their connections are closed before the transist drains them.
 static void kill_collectors(LogController* controller) {
-    pid_t pids[LOG_TYPE_COUNT] = {controller->mlog_pid, controller->rlog_pid, controller->elog_pid,
-                                  controller->klog_pid, controller->blog_pid};
+    pid_t pids[LOG_TYPE_COUNT];
+    memcpy(pids, controller->collector_pid, sizeof(pids));
     signal_children(controller, SIGKILL);
     for (int poll = 0; poll < KILL_WAIT_POLLS; poll++) {
         bool all_gone = true;
@@ -336,9 +328,10 @@ static void join_transist_thread(pthread_t* thread, const char* which) {
 
 // A notice the writer sent while the run was stopping belongs to that run;
 // left in the counter it would stop the next run as soon as it starts.
-static void discard_stale_notices() {
+static void discard_stale_notices(LogController* controller) {
     uint64_t stale;
-    while (efd_thread >= 0 && RETRY_EINTR(read(efd_thread, &stale, sizeof(stale))) > 0) {
+    while (controller->efd_thread >= 0 &&
+           TEMP_FAILURE_RETRY(read(controller->efd_thread, &stale, sizeof(stale))) > 0) {
     }
 }
 
@@ -351,7 +344,7 @@ void stop_logging(LogController* controller) {
     reap_children();
     // The daemon's own record decides: the property may have been set by hand.
     if (!controller->run_active) {
-        controller->log_path_state = -1;
+        controller->log_path_state = LOG_PATH_UNKNOWN;
         HLOG(TAG_MAIN, WLOG_ERROR, "tavlolog already stopped, ignore this stop");
         if (is_running()) property_set(PROP_RUNNING, "0");
         return;
@@ -372,8 +365,8 @@ void stop_logging(LogController* controller) {
     }
     kill_collectors(controller);
     controller->warned = 0;
-    if (shm_fd > 0) close(shm_fd);
-    shm_fd = -1;
+    if (controller->shm_fd > 0) close(controller->shm_fd);
+    controller->shm_fd = -1;
     release_control_block(controller);
 
     // Only now that no collector can write any more may the transist finish:
@@ -386,8 +379,8 @@ void stop_logging(LogController* controller) {
     controller->run_active = false;
     // Only now: until the writer has ended it must check the free space of
     // the run's own root (/data for a run held there), not the card's.
-    controller->log_path_state = -1;
-    discard_stale_notices();
+    controller->log_path_state = LOG_PATH_UNKNOWN;
+    discard_stale_notices(controller);
     HLOG(TAG_MAIN, WLOG_INFO, "tavlolog stop done");
 }
 
@@ -405,7 +398,7 @@ void switch_run_folder(LogController* controller, const char* path) {
     publish_run_folder(controller, path);
     publish_boot_wallclock();
     set_logsize_property(controller->rotate_size_kb);
-    change_log_folder(path, controller->rotate_size_kb);
+    change_log_folder(path, controller->logpath, controller->rotate_size_kb);
     sleep(1);
 }
 
@@ -418,14 +411,11 @@ void signal_child(int pid, int sig) {
 }
 
 void signal_children(LogController* controller, int sig) {
-    pid_t* pids[LOG_TYPE_COUNT] = {&controller->mlog_pid, &controller->rlog_pid,
-                                   &controller->elog_pid, &controller->klog_pid,
-                                   &controller->blog_pid};
-    for (pid_t* pid : pids) {
-        if (*pid != 0) signal_child(*pid, sig);
+    for (pid_t pid : controller->collector_pid) {
+        if (pid != 0) signal_child(pid, sig);
     }
     if (sig == SIGKILL) {
-        for (pid_t* pid : pids) *pid = 0;
+        for (pid_t& pid : controller->collector_pid) pid = 0;
     }
 }
 

@@ -4,18 +4,21 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include "common/wlog.h"
 #include "core/boot_mode.h"
 #include "core/boot_start.h"
 #include "core/log_controller.h"
 #include "core/privileges.h"
 #include "platform/properties.h"
+#include "record/record.h"
 #include "storage/history_log.h"
 #include "transist/transist.h"
 
 int main() {
     // A client or collector that has gone must give EPIPE, not end the daemon.
     signal(SIGPIPE, SIG_IGN);
+    // From here on every record also reaches the history, in this process and
+    // in every collector it forks.
+    record_set_history_sink(history_vlog);
     // A daemon restarted after a death finds its predecessor's run in these:
     // before anything reads them, no run is live and no run folder may receive
     // this daemon's records.
@@ -28,7 +31,7 @@ int main() {
         drop_privileges();
     }
 
-    history_log(0, "****** TQLOG START *******");
+    record_history(0, "****** TQLOG START *******");
     WLOG(TAG_DEBUG, WLOG_INFO, "****** TQLOG START *******");
 
     // Before any app runs: an app that bound "log_socket" first would keep

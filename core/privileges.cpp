@@ -8,8 +8,7 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
-#include "common/wlog.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 
 const gid_t DAEMON_GROUPS[DAEMON_GROUP_COUNT] = {1000, 1001, 1007, 1015, 9998, 2001, 1028, 1023};
 

@@ -1,12 +1,12 @@
-// Replies and broadcasts to control clients.
+#include "core/reply_client.h"
+
 #include <string.h>
 #include <unistd.h>
 
 #include <sys/socket.h>
 
-#include "common/wlog.h"
-#include "core/control_socket.h"
 #include "core/log_controller.h"
+#include "record/record.h"
 
 // A client that stops reading must not hold up the control thread or the
 // transist's writer: the texts are tiny and are sent without waiting.

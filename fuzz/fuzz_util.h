@@ -9,6 +9,12 @@
 #include <random>
 #include <string>
 
+#include "record/record.h"
+#include "storage/history_log.h"
+
+// The code under test records into the history, as the daemon's start-up sets it up.
+[[maybe_unused]] static const bool history_sink_installed = (record_set_history_sink(history_vlog), true);
+
 struct Fuzz {
     std::mt19937_64 rng;
     unsigned long round = 0;

@@ -121,8 +121,8 @@ int logger_write(const char* buffer, const void* payload, size_t n, const Logger
             return 0;
         }
         strcat(path, buffer);
-        UniqueFd fd(RETRY_EINTR(open(path, O_WRONLY | O_CLOEXEC)));
-        return fd.ok() && RETRY_EINTR(write(fd.get(), payload, n)) >= 0 ? 1 : 0;
+        UniqueFd fd(TEMP_FAILURE_RETRY(open(path, O_WRONLY | O_CLOEXEC)));
+        return fd.ok() && TEMP_FAILURE_RETRY(write(fd.get(), payload, n)) >= 0 ? 1 : 0;
     }
     // Name, NUL, header, payload: one write, one entry.
     uint8_t bytes[16 + LOGGER_HEADER_LEN + LOGGER_MAX_PAYLOAD];
@@ -135,6 +135,6 @@ int logger_write(const char* buffer, const void* payload, size_t n, const Logger
     memcpy(bytes, buffer, name_len);
     memcpy(bytes + name_len, header, LOGGER_HEADER_LEN);
     memcpy(bytes + name_len + LOGGER_HEADER_LEN, payload, n);
-    UniqueFd fd(RETRY_EINTR(open(LOGGER_INJECT_PATH, O_WRONLY | O_CLOEXEC)));
-    return fd.ok() && RETRY_EINTR(write(fd.get(), bytes, name_len + LOGGER_HEADER_LEN + n)) >= 0 ? 1 : 0;
+    UniqueFd fd(TEMP_FAILURE_RETRY(open(LOGGER_INJECT_PATH, O_WRONLY | O_CLOEXEC)));
+    return fd.ok() && TEMP_FAILURE_RETRY(write(fd.get(), bytes, name_len + LOGGER_HEADER_LEN + n)) >= 0 ? 1 : 0;
 }

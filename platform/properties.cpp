@@ -65,13 +65,13 @@ static int starts_with(const char* s, const char* prefix) {
 static int read_value(const char* dir, const char* key, char* value) {
     char path[PATH_LEN];
     snprintf(path, sizeof(path), "%s/%s", dir, key);
-    UniqueFd fd(RETRY_EINTR(open(path, O_RDONLY | O_CLOEXEC | O_NOFOLLOW)));
+    UniqueFd fd(TEMP_FAILURE_RETRY(open(path, O_RDONLY | O_CLOEXEC | O_NOFOLLOW)));
     if (!fd.ok()) return -1;
     // A value is at most PROPERTY_VALUE_MAX - 1 bytes; anything beyond (a file
     // written by hand on the host) is cut.
     size_t got = 0;
     while (got < PROPERTY_VALUE_MAX - 1) {
-        ssize_t n = RETRY_EINTR(read(fd.get(), value + got, PROPERTY_VALUE_MAX - 1 - got));
+        ssize_t n = TEMP_FAILURE_RETRY(read(fd.get(), value + got, PROPERTY_VALUE_MAX - 1 - got));
         if (n < 0) return -1;
         if (n == 0) break;
         got += static_cast<size_t>(n);
@@ -87,7 +87,7 @@ static int write_temp(const char* dir, const char* key, const char* value, mode_
     // with one. pid, thread id and a counter make the name private.
     snprintf(tmp, tmp_len, "%s/.tmp.%s.%d.%d.%u", dir, key, static_cast<int>(getpid()),
              static_cast<int>(gettid()), g_temp_seq.fetch_add(1, std::memory_order_relaxed));
-    UniqueFd fd(RETRY_EINTR(
+    UniqueFd fd(TEMP_FAILURE_RETRY(
         open(tmp, O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC | O_NOFOLLOW, mode)));
     if (!fd.ok()) return -1;
     size_t len = strlen(value);
@@ -130,7 +130,7 @@ static int publish(const char* dir, const char* key, const char* value, mode_t m
     if (rc != 0) return -1;
     if (sync) {
         // The rename itself must reach the disk, or a power cut loses it.
-        UniqueFd dfd(RETRY_EINTR(open(dir, O_RDONLY | O_DIRECTORY | O_CLOEXEC)));
+        UniqueFd dfd(TEMP_FAILURE_RETRY(open(dir, O_RDONLY | O_DIRECTORY | O_CLOEXEC)));
         if (!dfd.ok() || fsync(dfd.get()) != 0) return -1;
     }
     return 0;
@@ -157,9 +157,9 @@ int property_set(const char* key, const char* value) {
     // running value when it cannot be: a persist. value that would silently
     // vanish at the next boot is worse than a refused set. The folder lock
     // keeps concurrent sets of one key from leaving the two copies different.
-    UniqueFd dfd(RETRY_EINTR(open(PROPERTY_PERSIST_DIR, O_RDONLY | O_DIRECTORY | O_CLOEXEC)));
+    UniqueFd dfd(TEMP_FAILURE_RETRY(open(PROPERTY_PERSIST_DIR, O_RDONLY | O_DIRECTORY | O_CLOEXEC)));
     if (!dfd.ok()) return -1;
-    if (RETRY_EINTR(flock(dfd.get(), LOCK_EX)) != 0) return -1;
+    if (TEMP_FAILURE_RETRY(flock(dfd.get(), LOCK_EX)) != 0) return -1;
     if (publish(PROPERTY_PERSIST_DIR, key, value, kPersistFileMode, true, false) != 0) return -1;
     return publish(PROPERTY_AREA_DIR, key, value, kAreaFileMode, false, false);
 }

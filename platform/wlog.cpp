@@ -4,7 +4,7 @@
 // and collector processes) whole without any lock, and no lock means nothing
 // a fork could leave held. The time is computed by hand for the same reason:
 // glibc's localtime_r and gmtime_r take a process-wide lock.
-#include "common/wlog.h"
+#include "platform/wlog.h"
 
 #include <atomic>
 #include <errno.h>
@@ -140,11 +140,11 @@ extern "C" int __wlog_buf_printf(int buffer, const struct wlog_record* record, .
 
     int rc = -1;
     // O_NONBLOCK: should the log ever be a pipe, a stalled reader must not stall the daemon.
-    int fd = RETRY_EINTR(open(WLOG_PATH, O_WRONLY | O_APPEND | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
+    int fd = TEMP_FAILURE_RETRY(open(WLOG_PATH, O_WRONLY | O_APPEND | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
     if (fd >= 0) {
         // One write, never completed by a second one: a second write could land
         // after another writer's line and split this one.
-        rc = static_cast<int>(RETRY_EINTR(write(fd, line, len)));
+        rc = static_cast<int>(TEMP_FAILURE_RETRY(write(fd, line, len)));
         close(fd);
     }
     errno = saved_errno;

@@ -10,10 +10,9 @@
 
 #include "common/io_util.h"
 #include "common/unique_fd.h"
-#include "common/wlog.h"
 #include "platform/kernel_files.h"
 #include "platform/properties.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 #include "storage/safe_file.h"
 
 namespace {
@@ -28,7 +27,7 @@ constexpr useconds_t DUMP_PAUSE_US = 100000;
 int open_source(const char* source) {
     const char* root = trusted_root_of(source, nullptr);
     if (root != nullptr) return safe_open_path_file(root, source, SAFE_READ, 0);
-    int fd = RETRY_EINTR(open(kernel_file_path(source), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
+    int fd = TEMP_FAILURE_RETRY(open(kernel_file_path(source), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
     struct stat st;
     if (fd >= 0 && (fstat(fd, &st) != 0 || !S_ISREG(st.st_mode))) {
         close(fd);
@@ -74,7 +73,7 @@ void dump_file(DumpEntry* entry) {
     bool ok = write_text(out.get(), buf, static_cast<size_t>(len));
     // The bytes go over unchanged; a failing read or write ends this file's
     // dump with one record, not one per line.
-    for (ssize_t n; ok && (n = RETRY_EINTR(read(in.get(), buf, sizeof(buf)))) != 0;)
+    for (ssize_t n; ok && (n = TEMP_FAILURE_RETRY(read(in.get(), buf, sizeof(buf)))) != 0;)
         ok = n > 0 && write_text(out.get(), buf, static_cast<size_t>(n));
     if (!ok) HLOG(TAG_DUPM, WLOG_ERROR, "error when dump %s, file may incomplete", entry->source);
     write_text(out.get(), kFooter, sizeof(kFooter) - 1);

@@ -9,10 +9,9 @@
 
 #include "common/io_util.h"
 #include "common/unique_fd.h"
-#include "common/wlog.h"
 #include "platform/kernel_files.h"
+#include "record/record.h"
 #include "storage/debug_dump.h"
-#include "storage/history_log.h"
 
 namespace {
 
@@ -123,7 +122,7 @@ DumpEntry* parse_dump_list_text(const char* text, size_t len, const char* root,
 }
 
 DumpEntry* parse_dump_list(const char* path, const char* root, const char* run_folder) {
-    UniqueFd fd(RETRY_EINTR(open(path, O_RDONLY | O_CLOEXEC | O_NONBLOCK)));
+    UniqueFd fd(TEMP_FAILURE_RETRY(open(path, O_RDONLY | O_CLOEXEC | O_NONBLOCK)));
     size_t len = 0;
     bool cut = false;
     char* text = fd.ok() ? read_all(fd.get(), DUMP_LIST_CAP, &len, &cut) : nullptr;

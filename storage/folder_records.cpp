@@ -12,8 +12,7 @@
 #include "common/io_util.h"
 #include "common/limits.h"
 #include "common/unique_fd.h"
-#include "common/wlog.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 #include "storage/safe_file.h"
 
 namespace {
@@ -137,6 +136,7 @@ FolderRecord* read_folder_records(int location) {
     if (text == nullptr) {
         int err = errno;
         char path[PATH_LEN];
+        // "faild" as stored histories and tools have it.
         HLOG(TAG_SIZE, WLOG_ERROR, "open %s faild %s", records_path(name, path, sizeof(path)),
              strerror(err));
         return nullptr;
@@ -173,6 +173,7 @@ int write_folder_records(const FolderRecord* list, const char* new_name, int loc
     if (rc < 0) {
         int err = errno;
         char path[PATH_LEN];
+        // "faild" as stored histories and tools have it.
         HLOG(TAG_SIZE, WLOG_ERROR, "open %s faild %s", records_path(name, path, sizeof(path)),
              strerror(err));
         return 0;

@@ -3,7 +3,6 @@
 #include <atomic>
 #include <errno.h>
 #include <fcntl.h>
-#include <libgen.h>
 #include <pthread.h>
 #include <stdarg.h>
 #include <stdio.h>
@@ -16,9 +15,10 @@
 #include "common/civil_time.h"
 #include "common/io_util.h"
 #include "common/limits.h"
+#include "common/text.h"
 #include "common/unique_fd.h"
-#include "common/wlog.h"
 #include "platform/properties.h"
+#include "record/record.h"
 #include "storage/safe_file.h"
 
 namespace {
@@ -96,19 +96,6 @@ void append_run_record(const char* folder, const char* line, size_t len) {
     UniqueFd fd(append_record(dir.get(), line, len));
 }
 
-// A record is one line: line breaks and other control bytes in a message
-// (a client's command text, a damaged configuration line) would forge or
-// garble lines, so they are shown as '?'. Tabs are harmless and stay.
-void make_printable(char* s) {
-    // A message that ends its line itself keeps its text whole.
-    size_t len = strlen(s);
-    if (len > 0 && s[len - 1] == '\n') s[len - 1] = '\0';
-    for (; *s != '\0'; s++) {
-        unsigned char c = static_cast<unsigned char>(*s);
-        if ((c < 0x20 && c != '\t') || c == 0x7f) *s = '?';
-    }
-}
-
 // Registered when the program loads, so every fork is covered, also those of
 // code that does not know about the history log: in the child the parent's
 // other threads are gone, and one of them may have held the lock.
@@ -140,6 +127,13 @@ void history_log_after_fork() {
 }
 
 void history_log(int level, const char* format, ...) {
+    va_list args;
+    va_start(args, format);
+    history_vlog(level, format, args);
+    va_end(args);
+}
+
+void history_vlog(int level, const char* format, va_list args) {
     if (level < 0 || level > 2) return;
     if (holding_history_lock) return;
 
@@ -147,11 +141,11 @@ void history_log(int level, const char* format, ...) {
     format_stamp(stamp, sizeof(stamp));
 
     char message[RECORD_LEN + 1];
-    va_list args;
-    va_start(args, format);
     if (vsnprintf(message, sizeof(message), format, args) < 0) message[0] = '\0';
-    va_end(args);
-    make_printable(message);
+    // A record is one line: line breaks and other control bytes in a message
+    // (a client's command text, a damaged configuration line) would forge or
+    // garble lines. Tabs are harmless and stay.
+    printable_record(message);
 
     // The line keeps room for its newline so each file gets it in one write.
     char line[RECORD_LEN + 2];
@@ -209,25 +203,4 @@ char* get_run_folder(char* out) {
     if (folder[0] == '\0') return nullptr;
     memcpy(out, folder, strlen(folder) + 1);
     return out;
-}
-
-int make_dir_recursive(const char* path) {
-    WLOG(TAG_UTIL, WLOG_INFO, "create dir %s", path);
-
-    char buf[RECORD_LEN + 1];
-    int ok = copy_str(buf, sizeof(buf), path);
-    if (ok) {
-        char parent[RECORD_LEN + 1];
-        copy_str(parent, sizeof(parent), dirname(buf));
-        // A failure of the parent shows in the mkdir below.
-        if (access(parent, F_OK) != 0) make_dir_recursive(parent);
-        if (mkdir(path, 0775) == 0) return 1;
-    } else {
-        // A cut path would create some other directory.
-        errno = ENAMETOOLONG;
-    }
-    int err = errno;
-    HLOG(TAG_UTIL, WLOG_ERROR, "mkdir fail(%s)", strerror(err));
-    errno = err;
-    return 0;
 }

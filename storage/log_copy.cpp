@@ -12,9 +12,7 @@
 #include "common/limits.h"
 #include "common/log_types.h"
 #include "common/unique_fd.h"
-#include "common/wlog.h"
-#include "core/log_controller.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 #include "storage/safe_file.h"
 #include "storage/storage_check.h"
 
@@ -28,19 +26,18 @@ constexpr int OLDEST_PIECE = 4;
 const char kNoteNormal[] = "TavloLog in Normal\n";
 const char kNoteLow[] = "TavloLog in Low Nand Storage, some or all boot(hbr) logs are NOT saved!!!\n";
 
-void warn_once(LogController* controller) {
-    if (controller->warned != 0) return;
+void warn_once(const HeldCopy& copy) {
+    if (*copy.warned != 0) return;
     report_system_warning(4);
-    controller->warned = 1;
+    *copy.warned = 1;
 }
 
 // A copy that could not finish keeps its source; what it appended goes again,
 // so that a later copy of that source does not hold its beginning twice.
-CopyResult copy_failed(LogController* controller, const char* src, int out, off_t before,
-                       bool destination) {
+CopyResult copy_failed(const HeldCopy& copy, const char* src, int out, off_t before, bool destination) {
     int err = errno;
     HLOG(TAG_MAIN, WLOG_ERROR, "file %s copy error! err:%s(%d)", src, strerror(err), err);
-    warn_once(controller);
+    warn_once(copy);
     if (out >= 0 && ftruncate(out, before) != 0) {
         err = errno;
         HLOG(TAG_MAIN, WLOG_ERROR, "cannot take back the partial copy of %s(%s)", src, strerror(err));
@@ -54,11 +51,6 @@ bool join(char* out, const char* a, const char* b, const char* c = "") {
     if (len >= 0 && len < PATH_LEN) return true;
     HLOG(TAG_MAIN, WLOG_ERROR, "%s%s%s is too long to copy", a, b, c);
     return false;
-}
-
-bool exists(const char* path) {
-    struct stat st;
-    return lstat(path, &st) == 0;
 }
 
 // "<type>" or "<type>.1" to "<type>.4": a name the run itself writes in its
@@ -81,7 +73,7 @@ bool holds_pieces(const char* src_dir, const char* name) {
     for (int n = 0; n <= OLDEST_PIECE; n++) {
         int len = n == 0 ? snprintf(piece, sizeof(piece), "%s%s", src_dir, name)
                          : snprintf(piece, sizeof(piece), "%s%s.%d", src_dir, name, n);
-        if (len >= 0 && static_cast<size_t>(len) < sizeof(piece) && exists(piece)) return true;
+        if (len >= 0 && static_cast<size_t>(len) < sizeof(piece) && path_exists(piece)) return true;
     }
     return false;
 }
@@ -111,7 +103,7 @@ int collect_name(void* arg, const char* name, int) {
 
 }  // namespace
 
-CopyResult copy_log_file(LogController* controller, const char* src, const char* dst) {
+CopyResult copy_log_file(const HeldCopy& copy, const char* src, const char* dst) {
     // The source first: one that is there but cannot be read (a folder, a
     // link) stays, and the destination is not touched for it.
     char folder[PATH_LEN];
@@ -126,30 +118,30 @@ CopyResult copy_log_file(LogController* controller, const char* src, const char*
     } else {
         errno = ENAMETOOLONG;
     }
-    if (!in.ok() && errno != ENOENT) return copy_failed(controller, src, -1, 0, false);
+    if (!in.ok() && errno != ENOENT) return copy_failed(copy, src, -1, 0, false);
 
-    UniqueFd out(safe_open_path_file(controller->logpath, dst, SAFE_APPEND, COPY_MODE));
+    UniqueFd out(safe_open_path_file(copy.log_root, dst, SAFE_APPEND, COPY_MODE));
     struct stat st;
     if (!out.ok() || fstat(out.get(), &st) != 0) {
         printf("file open error!\n");
         fflush(stdout);
-        warn_once(controller);
+        warn_once(copy);
         return COPY_KEPT;
     }
     off_t before = st.st_size;
-    const char* note = data_storage_low ? kNoteLow : kNoteNormal;
+    const char* note = copy.data_low ? kNoteLow : kNoteNormal;
     if (write_fully(out.get(), note, strlen(note)) != static_cast<ssize_t>(strlen(note)))
-        return copy_failed(controller, src, out.get(), before, true);
+        return copy_failed(copy, src, out.get(), before, true);
     if (in.ok()) {
         char buf[COPY_BUF];
-        for (ssize_t n; (n = RETRY_EINTR(read(in.get(), buf, sizeof(buf)))) != 0;) {
-            if (n < 0) return copy_failed(controller, src, out.get(), before, false);
+        for (ssize_t n; (n = TEMP_FAILURE_RETRY(read(in.get(), buf, sizeof(buf)))) != 0;) {
+            if (n < 0) return copy_failed(copy, src, out.get(), before, false);
             if (write_fully(out.get(), buf, static_cast<size_t>(n)) != n)
-                return copy_failed(controller, src, out.get(), before, true);
+                return copy_failed(copy, src, out.get(), before, true);
         }
         // The source goes only once the copy is on storage: a power cut between
         // the delete and the write-back would lose both.
-        if (RETRY_EINTR(fsync(out.get())) != 0) return copy_failed(controller, src, out.get(), before, true);
+        if (TEMP_FAILURE_RETRY(fsync(out.get())) != 0) return copy_failed(copy, src, out.get(), before, true);
         if (safe_remove_file(dir.get(), slash + 1) != 0) {
             int err = errno;
             HLOG(TAG_MAIN, WLOG_ERROR, "remove %s failed(%s)", src, strerror(err));
@@ -161,20 +153,20 @@ CopyResult copy_log_file(LogController* controller, const char* src, const char*
     return COPY_DONE;
 }
 
-CopyResult copy_named_file(LogController* controller, const char* src_dir, const char* dst_dir,
-                           const char* name) {
+CopyResult copy_named_file(const HeldCopy& copy, const char* src_dir, const char* dst_dir, const char* name) {
     char src[PATH_LEN];
     char dst[PATH_LEN];
     if (!join(src, src_dir, name) || !join(dst, dst_dir, name)) return COPY_KEPT;
-    if (!exists(src)) {
+    if (!path_exists(src)) {
+        // "is not exits" as stored histories and tools have it.
         HLOG(TAG_MAIN, WLOG_ERROR, "%s is not exits", src);
         return COPY_DONE;
     }
     HLOG(TAG_MAIN, WLOG_INFO, "starts copy '%s'", src);
-    return copy_log_file(controller, src, dst);
+    return copy_log_file(copy, src, dst);
 }
 
-CopyResult copy_remaining_files(LogController* controller, const char* src_dir, const char* dst_dir) {
+CopyResult copy_remaining_files(const HeldCopy& copy, const char* src_dir, const char* dst_dir) {
     NameList list;
     UniqueFd dir(safe_open_dir("/data", src_dir, false, 0));
     if (!dir.ok() || safe_list_dir(dir.get(), collect_name, &list) < 0) {
@@ -183,13 +175,13 @@ CopyResult copy_remaining_files(LogController* controller, const char* src_dir, 
         return COPY_KEPT;
     }
     for (int i = 0; i < list.count; i++) {
-        if (copy_named_file(controller, src_dir, dst_dir, list.names[i]) == COPY_ABORT) return COPY_ABORT;
+        if (copy_named_file(copy, src_dir, dst_dir, list.names[i]) == COPY_ABORT) return COPY_ABORT;
     }
     return COPY_DONE;
 }
 
-CopyResult copy_rotated_log(LogController* controller, const char* src_dir, const char* dst_dir,
-                            const char* name, const char* suffix) {
+CopyResult copy_rotated_log(const HeldCopy& copy, const char* src_dir, const char* dst_dir, const char* name,
+                            const char* suffix) {
     HLOG(TAG_MAIN, WLOG_INFO, "starts copy '%s'", name);
     char base[PATH_LEN];
     char dst[PATH_LEN];
@@ -201,32 +193,26 @@ CopyResult copy_rotated_log(LogController* controller, const char* src_dir, cons
     for (int n = OLDEST_PIECE; n >= 1; n--) {
         char piece[PATH_LEN + 8];
         snprintf(piece, sizeof(piece), "%s.%d", base, n);
-        if (!exists(piece)) continue;
-        CopyResult rc = copy_log_file(controller, piece, dst);
+        if (!path_exists(piece)) continue;
+        CopyResult rc = copy_log_file(copy, piece, dst);
         if (rc == COPY_ABORT) return rc;
         if (rc == COPY_KEPT) result = COPY_KEPT;
     }
-    CopyResult rc = copy_log_file(controller, base, dst);
+    CopyResult rc = copy_log_file(copy, base, dst);
     return rc == COPY_DONE ? result : rc;
 }
 
-CopyResult copy_log_folder(LogController* controller, const char* src_dir, const char* dst_dir,
-                           const char* suffix) {
+CopyResult copy_log_folder(const HeldCopy& copy, const char* src_dir, const char* dst_dir, const char* suffix) {
     WLOG(TAG_MAIN, WLOG_DEBUG, "prepare to copy '%s' to sdcard", suffix);
-    const struct {
-        int on;
-        const char* name;
-    } types[] = {{controller->kernel_log, "kernel_log"},
-                 {controller->android_log, "main_log"},
-                 {controller->android_log, "events_log"},
-                 {controller->android_log, "radio_log"},
-                 {controller->bt_log, "bt_log"}};
-    for (const auto& type : types) {
+    // In this order, as held logs have always been appended.
+    static const int order[LOG_TYPE_COUNT] = {LOG_KERNEL, LOG_MAIN, LOG_EVENTS, LOG_RADIO, LOG_BT};
+    for (int type : order) {
+        const char* name = log_type_name(type);
         // A log switched off now may hold pieces from when it was on: they too
         // go into its suffixed file, never under a name the run writes.
-        if (!type.on && !holds_pieces(src_dir, type.name)) continue;
-        if (copy_rotated_log(controller, src_dir, dst_dir, type.name, suffix) == COPY_ABORT)
+        if (!copy.enabled[type] && !holds_pieces(src_dir, name)) continue;
+        if (copy_rotated_log(copy, src_dir, dst_dir, name, suffix) == COPY_ABORT)
             return COPY_ABORT;
     }
-    return copy_remaining_files(controller, src_dir, dst_dir);
+    return copy_remaining_files(copy, src_dir, dst_dir);
 }

@@ -3,6 +3,7 @@
 #include <dirent.h>
 #include <errno.h>
 #include <fcntl.h>
+#include <libgen.h>
 #include <limits.h>
 #include <stdio.h>
 #include <string.h>
@@ -12,9 +13,8 @@
 #include "common/io_util.h"
 #include "common/limits.h"
 #include "common/unique_fd.h"
-#include "common/wlog.h"
-#include "storage/history_log.h"
-#include "storage/record_limit.h"
+#include "record/record.h"
+#include "record/record_limit.h"
 
 namespace {
 
@@ -82,14 +82,14 @@ const char* describe(int dirfd, const char* name, char* out, size_t n) {
 }
 
 int open_dir_at(int parent, const char* name) {
-    int fd = RETRY_EINTR(openat(parent, name, DIR_FLAGS));
-    if (fd < 0 && errno == EACCES) fd = RETRY_EINTR(openat(parent, name, PASS_FLAGS));
+    int fd = TEMP_FAILURE_RETRY(openat(parent, name, DIR_FLAGS));
+    if (fd < 0 && errno == EACCES) fd = TEMP_FAILURE_RETRY(openat(parent, name, PASS_FLAGS));
     return fd;
 }
 
 int open_root_as_is(const char* root) {
-    int fd = RETRY_EINTR(open(root, O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-    if (fd < 0 && errno == EACCES) fd = RETRY_EINTR(open(root, O_PATH | O_DIRECTORY | O_CLOEXEC));
+    int fd = TEMP_FAILURE_RETRY(open(root, O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (fd < 0 && errno == EACCES) fd = TEMP_FAILURE_RETRY(open(root, O_PATH | O_DIRECTORY | O_CLOEXEC));
     return fd;
 }
 
@@ -161,7 +161,7 @@ int remove_tree(int dirfd, const char* name, int depth) {
         errno = ELOOP;
         return -1;
     }
-    UniqueFd sub(RETRY_EINTR(openat(dirfd, name, DIR_FLAGS)));
+    UniqueFd sub(TEMP_FAILURE_RETRY(openat(dirfd, name, DIR_FLAGS)));
     if (!sub.ok()) return -1;
     // Entries removed during a listing may hide others from it: a second pass
     // takes what the first missed.
@@ -260,17 +260,17 @@ int safe_open_file(int dirfd, const char* name, SafeOpen how, mode_t mode) {
     int fd = -1;
     bool created = false;
     if (how == SAFE_READ) {
-        fd = RETRY_EINTR(openat(dirfd, name, base));
+        fd = TEMP_FAILURE_RETRY(openat(dirfd, name, base));
     } else {
         // O_EXCL first tells whether this open made the file (and so sets its mode).
         for (int tries = 0; tries < 3; tries++) {
-            fd = RETRY_EINTR(openat(dirfd, name, base | O_CREAT | O_EXCL, mode));
+            fd = TEMP_FAILURE_RETRY(openat(dirfd, name, base | O_CREAT | O_EXCL, mode));
             if (fd >= 0) {
                 created = true;
                 break;
             }
             if (errno != EEXIST || how == SAFE_EXCL) break;
-            fd = RETRY_EINTR(openat(dirfd, name, base | (how == SAFE_TRUNC ? O_TRUNC : 0)));
+            fd = TEMP_FAILURE_RETRY(openat(dirfd, name, base | (how == SAFE_TRUNC ? O_TRUNC : 0)));
             if (fd >= 0 || errno != ENOENT) break;
         }
     }
@@ -340,7 +340,7 @@ int safe_replace_commit(int dirfd, const char* name, int fd) {
         close(fd);
         return -1;
     }
-    int rc = RETRY_EINTR(fsync(fd));
+    int rc = TEMP_FAILURE_RETRY(fsync(fd));
     int err = errno;
     if (close(fd) != 0 && rc == 0) {
         rc = -1;
@@ -357,7 +357,7 @@ int safe_replace_commit(int dirfd, const char* name, int fd) {
     }
     // Makes the rename itself survive a power cut; the new file is in place
     // whatever this says.
-    if (RETRY_EINTR(fsync(dirfd)) != 0) {
+    if (TEMP_FAILURE_RETRY(fsync(dirfd)) != 0) {
         err = errno;
         HLOG(TAG_UTIL, WLOG_ERROR, "sync of the folder of %s failed(%s)", name, strerror(err));
     }
@@ -384,7 +384,7 @@ int safe_replace_file(int dirfd, const char* name, const void* data, size_t len,
 
 int safe_list_dir(int dirfd, int (*visit)(void* arg, const char* name, int type), void* arg) {
     // A descriptor of its own: closedir closes it, and the caller's stays put.
-    int fd = RETRY_EINTR(openat(dirfd, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    int fd = TEMP_FAILURE_RETRY(openat(dirfd, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     if (fd < 0) return -1;
     DIR* dir = fdopendir(fd);
     if (dir == nullptr) {
@@ -427,3 +427,32 @@ int safe_remove_file(int dirfd, const char* name) { return unlinkat(dirfd, name,
 int safe_remove_dir(int dirfd, const char* name) { return unlinkat(dirfd, name, AT_REMOVEDIR); }
 
 int safe_remove_tree(int dirfd, const char* name) { return remove_tree(dirfd, name, 0); }
+
+// Paths up to 254 characters, as the history cuts its lines.
+static constexpr size_t MAKE_DIR_BUF = 255;
+
+int make_dir_recursive(const char* path) {
+    WLOG(TAG_UTIL, WLOG_INFO, "create dir %s", path);
+
+    char buf[MAKE_DIR_BUF];
+    int ok = copy_str(buf, sizeof(buf), path);
+    if (ok) {
+        char parent[MAKE_DIR_BUF];
+        copy_str(parent, sizeof(parent), dirname(buf));
+        // A failure of the parent shows in the mkdir below.
+        if (access(parent, F_OK) != 0) make_dir_recursive(parent);
+        if (mkdir(path, 0775) == 0) return 1;
+    } else {
+        // A cut path would create some other directory.
+        errno = ENAMETOOLONG;
+    }
+    int err = errno;
+    HLOG(TAG_UTIL, WLOG_ERROR, "mkdir fail(%s)", strerror(err));
+    errno = err;
+    return 0;
+}
+
+bool path_exists(const char* path) {
+    struct stat st;
+    return lstat(path, &st) == 0;
+}

@@ -78,3 +78,11 @@ int safe_remove_dir(int dirfd, const char* name);  // empty folders only
 // Removes name and, when it is a folder, everything in it, without following
 // links. Fails (ELOOP) on folders nested deeper than 16.
 int safe_remove_tree(int dirfd, const char* name);
+
+// mkdir -p with mode 0775, following links (for the daemon's own folders in
+// /data). Returns 1 when the final mkdir succeeded, 0 otherwise (an existing
+// path counts as failure).
+int make_dir_recursive(const char* path);
+
+// True when path names anything, a link included (lstat).
+bool path_exists(const char* path);

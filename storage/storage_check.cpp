@@ -4,14 +4,13 @@
 #include <sys/statfs.h>
 
 #include "common/io_util.h"
-#include "common/wlog.h"
 #include "platform/properties.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 
 uint64_t get_free_space(const char* path, int retries) {
     while (retries >= 0) {
         struct statfs st;
-        if (RETRY_EINTR(statfs(path, &st)) != 0) {
+        if (TEMP_FAILURE_RETRY(statfs(path, &st)) != 0) {
             // Saved first: the history record itself may change errno.
             int err = errno;
             HLOG(TAG_UTIL, WLOG_ERROR, "Failed to get the file status of %s, errno=%d", path, err);
@@ -48,6 +47,7 @@ void report_system_warning(int type) {
     HLOG(TAG_MAIN, WLOG_ERROR, "prop:%s,temp:%s", "vold.encrypt_progress", progress);
     // While the phone encrypts its storage, logging breaking down is expected.
     if (progress[0] != '\0') {
+        // "encryping" as stored histories and tools have it.
         HLOG(TAG_MAIN, WLOG_ERROR, "phone is encryping, will not show red screen:%s", progress);
         return;
     }

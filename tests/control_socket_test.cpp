@@ -116,9 +116,9 @@ TEST_F(ControlSocketTest, OverlongMessageIsReadInBoundedPieces) {
 
 TEST_F(ControlSocketTest, StopsWhileStopped) {
     auto conn = connect_client();
-    controller->log_path_state = 0;
+    controller->log_path_state = LOG_PATH_HELD_IN_DATA;
     EXPECT_EQ("stop,1", exchange(conn.get(), "stop"));
-    EXPECT_EQ(-1, controller->log_path_state);
+    EXPECT_EQ(LOG_PATH_UNKNOWN, controller->log_path_state);
     EXPECT_EQ("stop,1", exchange(conn.get(), "stopnow"));  // anything after the word is ignored
     EXPECT_EQ("0", config_value("autostart"));
 

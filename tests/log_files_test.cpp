@@ -1,7 +1,6 @@
 // The run's output files on the phone's real /data.
 #include "transist/log_files.h"
 
-#include "core/log_controller.h"
 #include "test_util.h"
 #include "transist/transist_state.h"
 
@@ -34,11 +33,7 @@ class LogFilesTest : public ::testing::Test {
     }
     // Opens the files of a run in folder with only the given switches on.
     void open_run(const char* folder, int android, int kernel, int bt) {
-        LogController controller;
-        controller.android_log = android;
-        controller.kernel_log = kernel;
-        controller.bt_log = bt;
-        open_output_files(&controller, folder);
+        open_output_files({folder, "", {android != 0, android != 0, android != 0, kernel != 0, bt != 0}, 1024});
     }
 };
 
@@ -153,7 +148,7 @@ TEST_F(LogFilesTest, ChangeFolderReopensExactlyTheOpenFiles) {
     open_entry(LOG_MAIN, "/data/run/");
     open_entry(LOG_KERNEL, "/data/run/");
     ASSERT_EQ(write_log_data(LOG_MAIN, "before", 6), 6);
-    change_log_folder("/data/next/", 2048);
+    change_log_folder("/data/next/", "", 2048);
     EXPECT_EQ(files_in("/data/next"), (std::vector<std::string>{"kernel_log", "main_log"}));
     EXPECT_EQ(read_file("/data/next/kernel_log"), kHeader);
     EXPECT_EQ(read_file("/data/run/main_log"), kHeader + "before");
@@ -165,10 +160,10 @@ TEST_F(LogFilesTest, ChangeFolderReopensExactlyTheOpenFiles) {
     EXPECT_EQ(read_file("/data/next/main_log"), kHeader + "after");
 
     // A folder too long for the names keeps the current file; a missing one leaves none.
-    change_log_folder(("/data/" + std::string(250, 'n') + "/").c_str(), 1024);
+    change_log_folder(("/data/" + std::string(250, 'n') + "/").c_str(), "", 1024);
     ASSERT_EQ(write_log_data(LOG_MAIN, "kept", 4), 4);
     EXPECT_EQ(read_file("/data/next/main_log"), kHeader + "afterkept");
-    change_log_folder("/data/absent/", 1024);
+    change_log_folder("/data/absent/", "", 1024);
     EXPECT_EQ(log_files[LOG_MAIN].fd, -1);
 }
 

@@ -14,7 +14,9 @@
 #include "core/boot_start.h"
 #include "core/child_supervision.h"
 #include "core/log_controller.h"
+#include "core/run_host.h"
 #include "test_util.h"
+#include "transist/log_files.h"
 #include "transist/transist.h"
 
 namespace {
@@ -197,7 +199,7 @@ class RunTest : public ::testing::Test {
         source_ = open(kFifo, O_RDWR);  // never blocks, and the source always has a writer
         ASSERT_GE(source_, 0);
         controller_.boot_mode = 1;  // no exception-engine switch
-        controller_.kernel_log = 1;
+        controller_.log_on[LOG_KERNEL] = 1;
         controller_.log_file_num = 5;
         strcpy(controller_.logpath, "/data");  // where the writer measures free space
         ASSERT_EQ(create_run_folder(&controller_, "/data", "/data/run_test/"), 1);
@@ -231,7 +233,7 @@ TEST_F(RunTest, StopKeepsEverythingTheCollectorSent) {
     start_logging(&controller_);
     EXPECT_EQ(property(PROP_RUNNING), "1");
     EXPECT_EQ(property(PROP_LOGSIZE), "12288");
-    ASSERT_GT(controller_.klog_pid, 0);
+    ASSERT_GT(controller_.collector_pid[LOG_KERNEL], 0);
     std::string sent;
     for (int i = 0; i < 400; i++) sent += "<6>[" + std::to_string(i) + ".000000] a line of the kernel log, some padding\n";
     feed(sent);
@@ -244,14 +246,14 @@ TEST_F(RunTest, StopKeepsEverythingTheCollectorSent) {
         usleep(30000);
         feed(last);
     });
-    pid_t collector = controller_.klog_pid;
+    pid_t collector = controller_.collector_pid[LOG_KERNEL];
     stop_logging(&controller_);
     late.join();
     ASSERT_TRUE(wait_source_drained()) << "the collector ended before the late words came";
     sent += last;
 
     EXPECT_EQ(property(PROP_RUNNING), "0");
-    EXPECT_EQ(controller_.klog_pid, 0);
+    EXPECT_EQ(controller_.collector_pid[LOG_KERNEL], 0);
     EXPECT_EQ(controller_.shm, nullptr);
     std::string body = read_file("/data/run_test/kernel_log");
     EXPECT_TRUE(body == "-----timezone: GMT\n" + sent) << body.size() << " of " << sent.size() << " bytes";
@@ -261,7 +263,7 @@ TEST_F(RunTest, StopKeepsEverythingTheCollectorSent) {
 // A collector that died just before the stop, its notice not handled yet.
 TEST_F(RunTest, StopRecordsACollectorThatDiedJustBefore) {
     start_logging(&controller_);
-    pid_t collector = controller_.klog_pid;
+    pid_t collector = controller_.collector_pid[LOG_KERNEL];
     ASSERT_EQ(kill(collector, SIGKILL), 0);
     siginfo_t info;
     ASSERT_EQ(waitid(P_PID, collector, &info, WEXITED | WNOWAIT), 0);  // dead, not reaped
@@ -282,7 +284,7 @@ TEST_F(RunTest, CollectorKeepsNoneOfTheDaemonsDescriptors) {
     feed("x\n");
     ASSERT_TRUE(wait_source_drained());
     std::string held = "\n";
-    for (int fd = 0; fd < 1024; fd++) held += fd_target(controller_.klog_pid, fd) + "\n";
+    for (int fd = 0; fd < 1024; fd++) held += fd_target(controller_.collector_pid[LOG_KERNEL], fd) + "\n";
     for (int fd : {transist_listen_fd, client_[0], log_files[LOG_KERNEL].fd}) {
         std::string target = fd_target(getpid(), fd);
         ASSERT_NE(target, "");
@@ -295,7 +297,7 @@ TEST_F(RunTest, CollectorKeepsNoneOfTheDaemonsDescriptors) {
 // checks /data, and a notice sent during the stop does not outlive it.
 TEST_F(RunTest, StopLeavesNoFalseOrStaleStorageNotice) {
     strcpy(controller_.logpath, "/mnt/no_card");
-    controller_.log_path_state = 0;
+    controller_.log_path_state = LOG_PATH_HELD_IN_DATA;
     start_logging(&controller_);
     pid_t slow = fork();  // ignores the stop request: the stop waits its full second
     if (slow == 0) {
@@ -303,13 +305,25 @@ TEST_F(RunTest, StopLeavesNoFalseOrStaleStorageNotice) {
         pause();
         _exit(0);
     }
-    controller_.mlog_pid = slow;
+    controller_.collector_pid[LOG_MAIN] = slow;
     controller_.shm->slots[SLOT_MAIN].exited = 0;
     uint64_t notice = 1001;
-    ASSERT_EQ(write(efd_thread, &notice, sizeof(notice)), 8);
+    ASSERT_EQ(write(controller_.efd_thread, &notice, sizeof(notice)), 8);
     stop_logging(&controller_);
     EXPECT_FALSE(history_has("no space to write log"));
-    EXPECT_EQ(read(efd_thread, &notice, sizeof(notice)), -1) << "a stale notice would stop the next run";
+    EXPECT_EQ(read(controller_.efd_thread, &notice, sizeof(notice)), -1) << "a stale notice would stop the next run";
+}
+
+// The writer's give-up: every client hears the word before the control loop
+// is woken to end the run. One stream stands for both, so it shows their order.
+TEST_F(RunTest, WriterGivingUpTellsTheClientsBeforeTheControlLoop) {
+    controller_.efd_thread = client_[0];
+    run_host(&controller_)->writer_gave_up(BROADCAST_STORAGE_FULL, EVENT_STORAGE_LOW);
+    char buf[64];
+    ssize_t n = recv(client_[1], buf, sizeof(buf), MSG_DONTWAIT);
+    uint64_t event = EVENT_STORAGE_LOW;
+    EXPECT_EQ(std::string(buf, n > 0 ? static_cast<size_t>(n) : 0),
+              BROADCAST_STORAGE_FULL + std::string(reinterpret_cast<const char*>(&event), sizeof(event)));
 }
 
 // A collector that cannot open its source ends with its reason; being the
@@ -317,10 +331,10 @@ TEST_F(RunTest, StopLeavesNoFalseOrStaleStorageNotice) {
 TEST_F(RunTest, CollectorThatCannotOpenItsSourceStopsTheRun) {
     KmsgCat::kmsg_path = "/tmp/no_such_kmsg";
     start_logging(&controller_);
-    struct pollfd p = {efd_chld, POLLIN, 0};  // the SIGCHLD notice, as the control loop waits for it
+    struct pollfd p = {controller_.efd_chld, POLLIN, 0};  // the SIGCHLD notice, as the control loop waits for it
     uint64_t count;
     ASSERT_TRUE(wait_for([&] { return poll(&p, 1, 0) == 1; }, 5000));
-    ASSERT_EQ(read(efd_chld, &count, sizeof(count)), 8);
+    ASSERT_EQ(read(controller_.efd_chld, &count, sizeof(count)), 8);
     check_children(&controller_);
     EXPECT_TRUE(history_has("oru warning comes,type is 10"));
     EXPECT_EQ(property(PROP_RUNNING), "0");

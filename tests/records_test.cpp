@@ -8,8 +8,9 @@
 #include <atomic>
 #include <thread>
 
-#include "common/wlog.h"
-#include "storage/record_limit.h"
+#include "record/record.h"
+#include "record/record_limit.h"
+#include "storage/safe_file.h"
 #include "test_util.h"
 
 namespace {

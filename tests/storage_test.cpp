@@ -4,7 +4,6 @@
 
 #include <map>
 
-#include "core/log_controller.h"
 #include "storage/debug_dump.h"
 #include "storage/folder_records.h"
 #include "storage/log_copy.h"
@@ -172,20 +171,17 @@ TEST(CopyLogFolder, AppendsOldestPieceFirstAndKeepsWhatCannotGo) {
         {{{"kernel_log.2", "k2"}, {"kernel_log", std::string(9000, 'k')}}, 1, 0, 0, 0, 4096,
          {{"kernel_log.boot", "old" + N + "k2"}}, {"kernel_log"}, COPY_ABORT},
     };
-    LogController controller;
-    strcpy(controller.logpath, "/mnt/sdcard");
+    int warned = 0;
     for (const auto& c : cases) {
         SCOPED_TRACE(c.copied.begin()->second.substr(0, 40));
         ASSERT_EQ(0, system(("rm -rf " + kHeld + " " + kRun + "; mkdir -p " + kHeld + " " + kRun).c_str()));
         for (const auto& f : c.held) f.first.back() == '/' ? (void)mkdir((kHeld + f.first).c_str(), 0700) : write_file(kHeld + f.first, f.second);
         write_file(kRun + "kernel_log.boot", "old");
-        controller.kernel_log = c.kernel;
-        controller.android_log = c.android;
-        controller.bt_log = c.bt;
-        data_storage_low = c.low;
+        HeldCopy copy = {"/mnt/sdcard", {c.android != 0, c.android != 0, c.android != 0, c.kernel != 0, c.bt != 0},
+                         c.low != 0, &warned};
         struct rlimit limit = {c.file_limit, RLIM_INFINITY};
         setrlimit(RLIMIT_FSIZE, &limit);
-        CopyResult result = copy_log_folder(&controller, kHeld.c_str(), kRun.c_str(), ".boot");
+        CopyResult result = copy_log_folder(copy, kHeld.c_str(), kRun.c_str(), ".boot");
         limit.rlim_cur = RLIM_INFINITY;
         setrlimit(RLIMIT_FSIZE, &limit);
         EXPECT_EQ(c.result, result);
@@ -196,7 +192,7 @@ TEST(CopyLogFolder, AppendsOldestPieceFirstAndKeepsWhatCannotGo) {
     // The suffixed file cannot be opened: the held log stays, and goes to no file of the run instead.
     ASSERT_EQ(0, system(("rm -rf " + kHeld + "* " + kRun + "*; mkdir " + kRun + "kernel_log.boot").c_str()));
     write_file(kHeld + "kernel_log", "k0");
-    copy_log_folder(&controller, kHeld.c_str(), kRun.c_str(), ".boot");
+    copy_log_folder({"/mnt/sdcard", {false, false, false, true, false}, false, &warned}, kHeld.c_str(), kRun.c_str(), ".boot");
     EXPECT_EQ(Lines{"kernel_log.boot"}, files_in(kRun));
     EXPECT_EQ(Lines{"kernel_log"}, files_in(kHeld));
 }

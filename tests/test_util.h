@@ -25,6 +25,11 @@
 
 #include "collectors/control_block.h"
 #include "platform/properties.h"
+#include "record/record.h"
+#include "storage/history_log.h"
+
+// The code under test records into the history, as the daemon's start-up sets it up.
+[[maybe_unused]] static const bool history_sink_installed = (record_set_history_sink(history_vlog), true);
 
 constexpr char kHistory[] = "/data/misc/tqlog/tqlog_history";
 

@@ -8,7 +8,6 @@
 
 #include <thread>
 
-#include "core/log_controller.h"
 #include "storage/storage_check.h"
 #include "test_util.h"
 #include "transist/log_files.h"
@@ -61,21 +60,26 @@ bool closed_by_peer(int fd, int ms) {
     return n == 0 || (n < 0 && errno == ECONNRESET);
 }
 
+// The host a run's controller is, for a run held in /data: the writer checks "/data".
+struct FakeHost : TransistHost {
+    const char* space_root() const override { return "/data"; }
+    void writer_gave_up(const char*, uint64_t) override {}
+    int flush_records() override { return transist_records_flush(); }
+};
+
 class TransistTest : public ::testing::Test {
   protected:
     void SetUp() override {
         ASSERT_EQ(system("rm -rf /data/run /data/misc/tqlog/tqlog_history"), 0);
         ASSERT_EQ(property_set("debug.TQ.interval", "1"), 0);
         mkdir(kRun, 0770);
-        controller_ = new LogController();  // like the daemon's, never destroyed
-        controller_->android_log = controller_->kernel_log = controller_->bt_log = 1;
-        controller_->log_path_state = 0;  // a run in /data: the writer checks "/data"
     }
     void TearDown() override {
         if (running_) stop();
     }
     void start(int rotate_kb = 1024) {
-        transist_create(controller_, kRun, rotate_kb);
+        run_.rotate_kb = rotate_kb;
+        transist_create(&host_, run_);
         running_ = true;
     }
     // The controller's stop sequence once the collectors have ended.
@@ -92,7 +96,8 @@ class TransistTest : public ::testing::Test {
     }
     std::string log(const char* name) { return read_file(std::string(kRun) + name); }
 
-    LogController* controller_ = nullptr;
+    FakeHost host_;
+    TransistRun run_ = {kRun, "", {true, true, true, true, true}, 1024};
     bool running_ = false;
 };
 
@@ -170,7 +175,7 @@ TEST_F(TransistTest, ConnectionsOfOtherProcessesAreRefused) {
 
 // A type whose collector ended can connect again; a type without a file is dropped.
 TEST_F(TransistTest, EndedTypesReconnectAndTypesWithoutFileAreDropped) {
-    controller_->android_log = 0;
+    run_.enabled[LOG_MAIN] = run_.enabled[LOG_RADIO] = run_.enabled[LOG_EVENTS] = false;
     start();
     stream_log('K', "one\n");
     ASSERT_TRUE(wait_for([] { return history_has("handle log message failed in fd of kernel_log."); }, 2000));
@@ -221,9 +226,9 @@ uint64_t small_card_free(const char*) {
 // One cycle carrying 8 MB must stop at the 10 MiB reserve, not after it.
 TEST_F(TransistTest, ReserveHoldsWhileACycleWrites) {
     writer_free_space = small_card_free;
-    transist_controller = controller_;  // as a run's start sets it
+    transist_host = &host_;  // as a run's start sets it
     rotate_limit_kb = 1 << 20;          // one file holds it all
-    open_output_files(controller_, kRun);
+    open_output_files(run_);
     TransistQueue q = {};
     std::string chunk(CHUNK_MAX, 'k');
     for (int i = 0; i < (8 << 20) / CHUNK_MAX; i++) ASSERT_EQ(queue_append(&q, LOG_KERNEL, chunk.data(), CHUNK_MAX, 65535), 1);

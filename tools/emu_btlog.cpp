@@ -53,9 +53,9 @@ void on_stop(int) { g_stop = 1; }
 bool status_lists_group(pid_t pid, gid_t gid) {
     char path[64];
     snprintf(path, sizeof(path), "/proc/%d/status", static_cast<int>(pid));
-    UniqueFd fd(RETRY_EINTR(open(path, O_RDONLY | O_CLOEXEC)));
+    UniqueFd fd(TEMP_FAILURE_RETRY(open(path, O_RDONLY | O_CLOEXEC)));
     char text[4096];
-    ssize_t n = fd.ok() ? RETRY_EINTR(read(fd.get(), text, sizeof(text) - 1)) : -1;
+    ssize_t n = fd.ok() ? TEMP_FAILURE_RETRY(read(fd.get(), text, sizeof(text) - 1)) : -1;
     if (n <= 0) return false;
     text[n] = '\0';
     const char* p = strstr(text, "\nGroups:");
@@ -128,7 +128,7 @@ void send_some(Client* c) {
 }
 
 int serve(const char* feed_path, int ready_fd) {
-    UniqueFd feed(RETRY_EINTR(open(feed_path, O_RDWR | O_NONBLOCK | O_CLOEXEC)));
+    UniqueFd feed(TEMP_FAILURE_RETRY(open(feed_path, O_RDWR | O_NONBLOCK | O_CLOEXEC)));
     if (!feed.ok()) {
         fprintf(stderr, "emu_btlog: cannot open %s: %s\n", feed_path, strerror(errno));
         return 1;
@@ -150,7 +150,7 @@ int serve(const char* feed_path, int ready_fd) {
 
     char pid_text[16];
     int n = snprintf(pid_text, sizeof(pid_text), "%d\n", static_cast<int>(getpid()));
-    UniqueFd pid_fd(RETRY_EINTR(open(kPidFile, O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, 0644)));
+    UniqueFd pid_fd(TEMP_FAILURE_RETRY(open(kPidFile, O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, 0644)));
     if (pid_fd.ok()) write_fully(pid_fd.get(), pid_text, static_cast<size_t>(n));
     pid_fd.reset();
     if (ready_fd >= 0) {
@@ -207,15 +207,15 @@ int serve(const char* feed_path, int ready_fd) {
 // The running service's pid, or -1: the pid file must name an emu_btlog.
 pid_t running_pid() {
     char text[32] = "";
-    UniqueFd fd(RETRY_EINTR(open(kPidFile, O_RDONLY | O_CLOEXEC)));
-    if (!fd.ok() || RETRY_EINTR(read(fd.get(), text, sizeof(text) - 1)) <= 0) return -1;
+    UniqueFd fd(TEMP_FAILURE_RETRY(open(kPidFile, O_RDONLY | O_CLOEXEC)));
+    if (!fd.ok() || TEMP_FAILURE_RETRY(read(fd.get(), text, sizeof(text) - 1)) <= 0) return -1;
     pid_t pid = static_cast<pid_t>(atoi(text));
     if (pid <= 0) return -1;
     char path[64];
     char comm[32] = "";
     snprintf(path, sizeof(path), "/proc/%d/comm", static_cast<int>(pid));
-    UniqueFd comm_fd(RETRY_EINTR(open(path, O_RDONLY | O_CLOEXEC)));
-    if (!comm_fd.ok() || RETRY_EINTR(read(comm_fd.get(), comm, sizeof(comm) - 1)) <= 0) return -1;
+    UniqueFd comm_fd(TEMP_FAILURE_RETRY(open(path, O_RDONLY | O_CLOEXEC)));
+    if (!comm_fd.ok() || TEMP_FAILURE_RETRY(read(comm_fd.get(), comm, sizeof(comm) - 1)) <= 0) return -1;
     return strncmp(comm, "emu_btlog\n", 10) == 0 ? pid : -1;
 }
 
@@ -224,8 +224,8 @@ bool has_ended(pid_t pid) {
     char path[64];
     char stat_text[256] = "";
     snprintf(path, sizeof(path), "/proc/%d/stat", static_cast<int>(pid));
-    UniqueFd fd(RETRY_EINTR(open(path, O_RDONLY | O_CLOEXEC)));
-    if (!fd.ok() || RETRY_EINTR(read(fd.get(), stat_text, sizeof(stat_text) - 1)) <= 0) return true;
+    UniqueFd fd(TEMP_FAILURE_RETRY(open(path, O_RDONLY | O_CLOEXEC)));
+    if (!fd.ok() || TEMP_FAILURE_RETRY(read(fd.get(), stat_text, sizeof(stat_text) - 1)) <= 0) return true;
     const char* state = strrchr(stat_text, ')');
     return state != nullptr && (state[2] == 'Z' || state[2] == 'X');
 }
@@ -252,7 +252,7 @@ int start_service(const char* feed_path) {
     if (pid > 0) {
         close(ready[1]);
         char ok = 0;
-        return RETRY_EINTR(read(ready[0], &ok, 1)) == 1 && ok == 1 ? 0 : 1;
+        return TEMP_FAILURE_RETRY(read(ready[0], &ok, 1)) == 1 && ok == 1 ? 0 : 1;
     }
     close(ready[0]);
     setsid();

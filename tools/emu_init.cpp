@@ -56,7 +56,7 @@ static void init_log(const char* fmt, ...) {
     va_end(ap);
     size_t len = strlen(line);
     line[len++] = '\n';
-    UniqueFd fd(RETRY_EINTR(open(kInitLog, O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0644)));
+    UniqueFd fd(TEMP_FAILURE_RETRY(open(kInitLog, O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0644)));
     if (fd.ok()) write_fully(fd.get(), line, len);
 }
 
@@ -77,7 +77,7 @@ static void prepare_dir(const char* path, mode_t mode, uid_t uid, gid_t gid) {
 }
 
 static void prepare_file(const char* path, mode_t mode) {
-    UniqueFd fd(RETRY_EINTR(open(path, O_WRONLY | O_CREAT | O_CLOEXEC | O_NOFOLLOW, mode)));
+    UniqueFd fd(TEMP_FAILURE_RETRY(open(path, O_WRONLY | O_CREAT | O_CLOEXEC | O_NOFOLLOW, mode)));
     if (!fd.ok() || fchmod(fd.get(), mode) != 0)
         init_log("cannot prepare %s: %s", path, strerror(errno));
 }
@@ -91,7 +91,7 @@ static int run_tool(const char* const argv[]) {
         _exit(127);
     }
     int status = 0;
-    if (RETRY_EINTR(waitpid(pid, &status, 0)) != pid) return -1;
+    if (TEMP_FAILURE_RETRY(waitpid(pid, &status, 0)) != pid) return -1;
     return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
 
@@ -221,9 +221,9 @@ static void load_persistent_properties() {
         const char* key = entry->d_name;
         if (!property_key_valid(key) || strncmp(key, "persist.", 8) != 0) continue;
         char value[PROPERTY_VALUE_MAX];
-        UniqueFd fd(RETRY_EINTR(openat(dirfd(dir), key, O_RDONLY | O_CLOEXEC | O_NOFOLLOW)));
+        UniqueFd fd(TEMP_FAILURE_RETRY(openat(dirfd(dir), key, O_RDONLY | O_CLOEXEC | O_NOFOLLOW)));
         if (!fd.ok()) continue;
-        ssize_t n = RETRY_EINTR(read(fd.get(), value, sizeof(value) - 1));
+        ssize_t n = TEMP_FAILURE_RETRY(read(fd.get(), value, sizeof(value) - 1));
         if (n < 0) continue;
         value[n] = '\0';
         if (property_set_runtime(key, value) != 0)
@@ -239,7 +239,7 @@ static void load_persistent_properties() {
 static int hold_kmsg() {
     struct stat st;
     if (stat("/proc/kmsg", &st) != 0 || !S_ISFIFO(st.st_mode)) return -1;
-    int fd = RETRY_EINTR(open("/proc/kmsg", O_RDWR | O_NONBLOCK | O_CLOEXEC));
+    int fd = TEMP_FAILURE_RETRY(open("/proc/kmsg", O_RDWR | O_NONBLOCK | O_CLOEXEC));
     if (fd < 0) {
         init_log("cannot hold /proc/kmsg: %s", strerror(errno));
         return -1;
@@ -252,9 +252,9 @@ static int hold_kmsg() {
 // the steps tavlo-emu left (e.g. "after 3 link"), when it left any.
 static void start_ext_sdcard_tool(const sigset_t* old_mask) {
     char steps[256];
-    UniqueFd fd(RETRY_EINTR(open(kExtSdcardSteps, O_RDONLY | O_CLOEXEC)));
+    UniqueFd fd(TEMP_FAILURE_RETRY(open(kExtSdcardSteps, O_RDONLY | O_CLOEXEC)));
     if (!fd.ok()) return;
-    ssize_t n = RETRY_EINTR(read(fd.get(), steps, sizeof(steps) - 1));
+    ssize_t n = TEMP_FAILURE_RETRY(read(fd.get(), steps, sizeof(steps) - 1));
     if (n <= 0) return;
     steps[n] = '\0';
     const char* argv[32] = {kExtSdcardTool};
@@ -277,7 +277,7 @@ static void start_ext_sdcard_tool(const sigset_t* old_mask) {
 static int hold_btlog_feed() {
     struct stat st;
     if (stat("/dev/emu/btlog", &st) != 0 || !S_ISFIFO(st.st_mode)) return -1;
-    int fd = RETRY_EINTR(open("/dev/emu/btlog", O_RDWR | O_NONBLOCK | O_CLOEXEC));
+    int fd = TEMP_FAILURE_RETRY(open("/dev/emu/btlog", O_RDWR | O_NONBLOCK | O_CLOEXEC));
     if (fd < 0) {
         init_log("cannot hold /dev/emu/btlog: %s", strerror(errno));
         return -1;
@@ -321,7 +321,7 @@ static void write_daemon_pid(pid_t pid) {
     snprintf(tmp, sizeof(tmp), "%s.tmp", kDaemonPidFile);
     char text[32];
     int n = snprintf(text, sizeof(text), "%d\n", static_cast<int>(pid));
-    UniqueFd fd(RETRY_EINTR(open(tmp, O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644)));
+    UniqueFd fd(TEMP_FAILURE_RETRY(open(tmp, O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644)));
     if (!fd.ok() || write_fully(fd.get(), text, n) != n) return;
     fd.reset();
     rename(tmp, kDaemonPidFile);

@@ -102,9 +102,9 @@ KnownWriter g_writers[16];
 unsigned g_next_writer = 0;
 
 int32_t tgid_in(int dir, pid_t tid) {
-    UniqueFd fd(RETRY_EINTR(openat(dir, "status", O_RDONLY | O_CLOEXEC)));
+    UniqueFd fd(TEMP_FAILURE_RETRY(openat(dir, "status", O_RDONLY | O_CLOEXEC)));
     char text[512];
-    ssize_t n = fd.ok() ? RETRY_EINTR(read(fd.get(), text, sizeof(text) - 1)) : -1;
+    ssize_t n = fd.ok() ? TEMP_FAILURE_RETRY(read(fd.get(), text, sizeof(text) - 1)) : -1;
     if (n <= 0) return tid;
     text[n] = '\0';
     const char* at = strstr(text, "\nTgid:");
@@ -121,7 +121,7 @@ int32_t pid_of_writer(pid_t tid) {
     }
     char path[32];
     snprintf(path, sizeof(path), "/proc/%d", static_cast<int>(tid));
-    int dir = RETRY_EINTR(open(path, O_PATH | O_DIRECTORY | O_CLOEXEC));
+    int dir = TEMP_FAILURE_RETRY(open(path, O_PATH | O_DIRECTORY | O_CLOEXEC));
     if (dir < 0) return tid;
     KnownWriter& slot = g_writers[g_next_writer++ % 16];
     if (slot.dir >= 0) close(slot.dir);
@@ -435,7 +435,7 @@ int main(int argc, char** argv) {
         if (pid > 0) {
             close(ready[1]);
             char ok = 0;
-            return RETRY_EINTR(read(ready[0], &ok, 1)) == 1 && ok == 1 ? 0 : 1;
+            return TEMP_FAILURE_RETRY(read(ready[0], &ok, 1)) == 1 && ok == 1 ? 0 : 1;
         }
         close(ready[0]);
         setsid();

@@ -17,7 +17,6 @@
 
 #include "common/control_client.h"
 #include "common/control_protocol.h"
-#include "core/log_controller.h"
 #include "platform/properties.h"
 
 static constexpr int DEFAULT_TIMEOUT_S = 10;

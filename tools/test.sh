@@ -39,6 +39,7 @@ if [ $sanitize = 1 ]; then
     export UBSAN_OPTIONS=print_stacktrace=1:halt_on_error=1
 fi
 jobs=$(nproc)
+tools/check-layers.sh
 cmake -S . -B "$build" -G Ninja "${extra[@]}" >/dev/null
 cmake --build "$build" -j"$jobs"
 ctest --test-dir "$build" --output-on-failure -j"$jobs"

@@ -9,27 +9,30 @@
 #include <unistd.h>
 
 #include "common/io_util.h"
+#include "common/text.h"
 #include "common/unique_fd.h"
-#include "common/wlog.h"
-#include "core/log_controller.h"
 #include "platform/properties.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 #include "storage/safe_file.h"
 #include "transist/transist_queue.h"
 #include "transist/transist_state.h"
+
+LogFile log_files[LOG_TYPE_COUNT];
+pthread_mutex_t file_table_lock = PTHREAD_MUTEX_INITIALIZER;
+std::atomic<int> rotate_limit_kb{1024};
 
 static const char HEADER_PREFIX[] = "-----timezone: ";
 
 // One record per file for failed data writes: a full disk fails every node.
 static bool write_failure_recorded[LOG_TYPE_COUNT];
 
-// The controller's log path when the files were opened: a folder below it is
+// The run's log path when the files were opened: a folder below it is
 // trusted from there on, one in /data from "/data" (trusted_root_for); below
 // that nothing is opened through a link. file_table_lock.
 static char log_root[PATH_LEN];
 
-static void take_log_root() {
-    copy_str(log_root, sizeof(log_root), transist_controller ? transist_controller->logpath : "");
+static void take_log_root(const char* trusted_root) {
+    copy_str(log_root, sizeof(log_root), trusted_root ? trusted_root : "");
 }
 
 // Opens the folder of path (which ends in a file name) and puts the file
@@ -78,10 +81,7 @@ int format_header(char* out, size_t n, const char* timezone) {
     memcpy(zone, timezone, static_cast<size_t>(zone_len));
     zone[zone_len] = '\0';
     // A line feed inside the zone would split the header line.
-    for (int i = 0; i < zone_len; i++) {
-        unsigned char c = static_cast<unsigned char>(zone[i]);
-        if (c < 0x20 || c == 0x7f) zone[i] = '?';
-    }
+    printable_header(zone, static_cast<size_t>(zone_len));
     int len = snprintf(out, n, "%s%s\n", HEADER_PREFIX, zone);
     if (len < 0) return 0;
     return len < static_cast<int>(n) ? len : static_cast<int>(n) - 1;
@@ -112,7 +112,7 @@ static int open_in_folder(int dirfd, const char* name, const char* path) {
         int err = errno;
         HLOG(TAG_TRANSIST, WLOG_ERROR, "write %s fail,%s(%d)", path, strerror(err), err);
     }
-    RETRY_EINTR(fsync(fd));
+    TEMP_FAILURE_RETRY(fsync(fd));
     return fd;
 }
 
@@ -132,12 +132,10 @@ int compose_log_name(char* out, const char* folder, int type) {
     return 1;
 }
 
-void open_output_files(LogController* controller, const char* run_folder) {
-    bool enabled[LOG_TYPE_COUNT] = {controller->android_log != 0, controller->android_log != 0,
-                                    controller->android_log != 0, controller->kernel_log != 0,
-                                    controller->bt_log != 0};
+void open_output_files(const TransistRun& run) {
+    const char* run_folder = run.folder;
     pthread_mutex_lock(&file_table_lock);
-    take_log_root();
+    take_log_root(run.trusted_root);
     for (int type = 0; type < LOG_TYPE_COUNT; type++) {
         log_files[type].fd = -1;
         log_files[type].size = 0;
@@ -145,7 +143,7 @@ void open_output_files(LogController* controller, const char* run_folder) {
         write_failure_recorded[type] = false;
     }
     for (int type = 0; type < LOG_TYPE_COUNT; type++) {
-        if (!enabled[type]) continue;
+        if (!run.enabled[type]) continue;
         LogFile* entry = &log_files[type];
         if (!compose_log_name(entry->name, run_folder, type)) {
             HLOG(TAG_TRANSIST, WLOG_ERROR, "log file path too long: %.200s... + %s", run_folder,
@@ -189,7 +187,7 @@ int write_log_data(int type, const char* buf, int len) {
 void close_log_file(LogFile* entry) {
     if (entry->fd > 0) {
         // Closed for good: what the collectors sent must survive a power cut.
-        RETRY_EINTR(fsync(entry->fd));
+        TEMP_FAILURE_RETRY(fsync(entry->fd));
         close(entry->fd);
     }
     entry->fd = -1;
@@ -218,7 +216,7 @@ void sync_retired_files() {
     retired_count = 0;
     pthread_mutex_unlock(&file_table_lock);
     for (int i = 0; i < count; i++) {
-        RETRY_EINTR(fsync(fds[i]));
+        TEMP_FAILURE_RETRY(fsync(fds[i]));
         close(fds[i]);
     }
 }
@@ -266,9 +264,9 @@ void close_all_log_files() {
     }
 }
 
-void change_log_folder(const char* new_folder, int new_rotate_kb) {
+void change_log_folder(const char* new_folder, const char* trusted_root, int new_rotate_kb) {
     pthread_mutex_lock(&file_table_lock);
-    take_log_root();
+    take_log_root(trusted_root);
     for (int type = 0; type < LOG_TYPE_COUNT; type++) {
         LogFile* entry = &log_files[type];
         if (entry->fd <= 0) continue;

@@ -6,16 +6,26 @@
 #include <stddef.h>
 #include <stdint.h>
 
+#include "common/limits.h"
+#include "common/log_types.h"
 #include "transist/transist.h"
 
-class LogController;
+struct LogFile {
+    int fd;              // open output file, -1 when none; > 0 means open
+    int sock;            // collector connection registered for the type, -1 when none
+    int size;            // collector bytes written to the current file since it was opened
+    char name[PATH_LEN];  // full path of the output file
+};
+
+// Process-wide table of output files, one entry per log type (file_table_lock).
+extern LogFile log_files[LOG_TYPE_COUNT];
 
 // Longest header line, line feed included ("-----timezone: " + 83 characters).
 constexpr int HEADER_MAX = 99;
 
-// Resets the table and opens the files of the types the controller enables.
-// Takes file_table_lock itself.
-void open_output_files(LogController* controller, const char* run_folder);
+// Resets the table and opens the files of the types the run enables in its
+// folder; keeps its trusted root for later opens. Takes file_table_lock itself.
+void open_output_files(const TransistRun& run);
 
 // Opens path for appending (mode 0600), writes the header and syncs it.
 // Returns the descriptor, or the failed open's -1 with errno set.

@@ -14,25 +14,22 @@
 #include <cutils/sockets.h>
 
 #include "common/io_util.h"
-#include "common/wlog.h"
+#include "common/text.h"
 #include "platform/properties.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 #include "transist/log_files.h"
 #include "transist/transist_queue.h"
 #include "transist/transist_state.h"
 
 std::atomic<bool> stop_requested{false};
-LogFile log_files[LOG_TYPE_COUNT];
 int transist_listen_fd = -1;
 pthread_t read_thread_id;
 pthread_t write_thread_id;
 
-pthread_mutex_t file_table_lock = PTHREAD_MUTEX_INITIALIZER;
-std::atomic<int> rotate_limit_kb{1024};
 int transist_capacity = DEFAULT_CAPACITY;
 int transist_interval = 1;
 int transist_throughput = 2;
-LogController* transist_controller = nullptr;
+TransistHost* transist_host = nullptr;
 std::atomic<bool> writer_running{false};
 bool reader_paused = false;
 int reader_wake_fd = -1;
@@ -45,12 +42,6 @@ static bool reader_done = false;    // wake_lock
 
 // The longest period the writer's microsecond arithmetic was designed for.
 static const int MAX_INTERVAL = 2147;
-
-int64_t monotonic_us() {
-    timespec ts;
-    clock_gettime(CLOCK_MONOTONIC, &ts);
-    return static_cast<int64_t>(ts.tv_sec) * 1000000 + ts.tv_nsec / 1000;
-}
 
 static void init_wake_once() {
     static pthread_once_t once = PTHREAD_ONCE_INIT;
@@ -112,7 +103,22 @@ bool wait_reader_done(int ms) {
 void wake_reader() {
     if (reader_wake_fd < 0) return;
     uint64_t one = 1;
-    RETRY_EINTR(write(reader_wake_fd, &one, sizeof(one)));
+    TEMP_FAILURE_RETRY(write(reader_wake_fd, &one, sizeof(one)));
+}
+
+static void close_if_open(int* fd) {
+    if (*fd > 0) close(*fd);
+    *fd = -1;
+}
+
+void transist_close_in_child() {
+    // The tables may be mid-update by the daemon's threads at the fork; the
+    // child only reads its own copy and owns no lock.
+    for (LogFile& file : log_files) {
+        close_if_open(&file.fd);
+        close_if_open(&file.sock);
+    }
+    close_if_open(&transist_listen_fd);
 }
 
 void transist_wake() {
@@ -121,15 +127,6 @@ void transist_wake() {
     pthread_mutex_lock(&wake_lock);
     pthread_cond_broadcast(&wake_cond);
     pthread_mutex_unlock(&wake_lock);
-}
-
-void printable_copy(char* dst, int n, const char* src) {
-    int i = 0;
-    for (; i < n - 1 && src[i] != '\0'; i++) {
-        unsigned char c = static_cast<unsigned char>(src[i]);
-        dst[i] = (c < 0x20 || c >= 0x7f) ? '?' : static_cast<char>(c);
-    }
-    dst[i] = '\0';
 }
 
 // A decimal number and nothing else (surrounding blanks allowed); false for
@@ -187,7 +184,7 @@ static void read_parameters() {
     transist_interval = choose_interval(value);
     long capacity = transist_capacity, throughput = transist_throughput,
          interval = transist_interval;
-    history_log(1, "buffer:%ldB; throughput:%ldMB/s; interval: %lds", capacity, throughput,
+    record_history(1, "buffer:%ldB; throughput:%ldMB/s; interval: %lds", capacity, throughput,
                 interval);
     WLOG(TAG_TRANSIST, WLOG_INFO, "buffer:%ldB; throughput:%ldMB/s; interval: %lds", capacity,
          throughput, interval);
@@ -232,13 +229,13 @@ int transist_listen() {
     return 1;
 }
 
-void transist_create(LogController* controller, const char* run_folder, int rotate_kb) {
+void transist_create(TransistHost* host, const TransistRun& run) {
     init_wake_once();
-    rotate_limit_kb = rotate_kb;
-    transist_controller = controller;
+    rotate_limit_kb = run.rotate_kb;
+    transist_host = host;
     read_parameters();
     discard_leftovers();
-    open_output_files(controller, run_folder);
+    open_output_files(run);
 
     if (reader_wake_fd < 0) reader_wake_fd = eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC);
     uint64_t stale;

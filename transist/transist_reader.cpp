@@ -10,13 +10,38 @@
 #include <unistd.h>
 
 #include "common/io_util.h"
-#include "common/wlog.h"
-#include "core/peer_auth.h"
-#include "storage/history_log.h"
+#include "common/peer_cred.h"
+#include "record/record_limit.h"
+#include "record/record.h"
+#include "transist/log_files.h"
 #include "transist/transist.h"
 #include "transist/transist_queue.h"
 #include "transist/transist_reader.h"
 #include "transist/transist_state.h"
+
+// Refusals of "log_socket" clients: any app can connect in a loop.
+static RecordLimit refused_log_peers = RECORD_LIMIT(TAG_TRANSIST, "refused log_socket clients");
+
+// Any local process can connect to an abstract socket: an app could forge
+// log lines, or displace a collector's connection and stop the run. The
+// collectors are the daemon's children; the daemon's user alone would also
+// admit the shell.
+static int log_peer_allowed(int fd) {
+    uid_t uid = 0;
+    pid_t pid = 0;
+    if (!peer_credentials(fd, &uid, &pid)) {
+        int err = errno;
+        HLOG_LIMITED(refused_log_peers, TAG_TRANSIST, WLOG_WARN,
+                     "cannot get credentials of log_socket client (%s), closed", strerror(err));
+        return 0;
+    }
+    if (is_self_or_child(pid)) return 1;
+    HLOG_LIMITED(refused_log_peers, TAG_TRANSIST, WLOG_WARN, "refuse log_socket client uid %d pid %d, closed",
+                 static_cast<int>(uid), static_cast<int>(pid));
+    return 0;
+}
+
+int transist_records_flush() { return record_limit_flush(&refused_log_peers); }
 
 // Guards only the copy of the registered descriptors into the poll set.
 static pthread_mutex_t select_set_lock = PTHREAD_MUTEX_INITIALIZER;
@@ -193,7 +218,7 @@ static void accept_connections() {
             // Usually out of descriptors: give the system a moment, but stay
             // responsive to a stop.
             struct pollfd wake = {reader_wake_fd, POLLIN, 0};
-            if (!stop_requested) RETRY_EINTR(poll(&wake, 1, 1000));
+            if (!stop_requested) TEMP_FAILURE_RETRY(poll(&wake, 1, 1000));
             return;
         }
         if (!log_peer_allowed(fd)) {
@@ -397,7 +422,7 @@ void* read_thread(void*) {
             if (err == EINTR) continue;
             HLOG(TAG_TRANSIST, WLOG_ERROR, "select failed (%s), error = %d", strerror(err), err);
             struct pollfd wake = {reader_wake_fd, POLLIN, 0};
-            RETRY_EINTR(poll(&wake, 1, 1000));
+            TEMP_FAILURE_RETRY(poll(&wake, 1, 1000));
             continue;
         }
         if (n > 0) {
@@ -406,7 +431,7 @@ void* read_thread(void*) {
             handle_ready(&set, 1);
         }
         expire_pending(monotonic_us());
-        peer_records_flush();
+        if (transist_host != nullptr) transist_host->flush_records();
     }
 
     // The listening socket stays for the next run: freed, its name could be

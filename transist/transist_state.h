@@ -1,4 +1,4 @@
-// State shared by the transist's own files: tuning, the run's controller, the
+// State shared by the transist's own files: tuning, the run's host, the
 // file-table lock and the wake-ups between the controller, reader and writer.
 // Not for use outside transist/ (and its tests).
 #pragma once
@@ -8,9 +8,11 @@
 
 #include <atomic>
 
-class LogController;
+#include "common/clock.h"
 
-// Guards log_files. Taken before queue_lock, never after it.
+class TransistHost;
+
+// Guards log_files (log_files.cpp). Taken before queue_lock, never after it.
 extern pthread_mutex_t file_table_lock;
 
 // Rotation limit in KB: written by the controller's thread, read by the writer.
@@ -19,7 +21,7 @@ extern std::atomic<int> rotate_limit_kb;
 extern int transist_capacity;    // node block size in bytes
 extern int transist_interval;    // writer period in seconds
 extern int transist_throughput;  // MB/s, only reported
-extern LogController* transist_controller;
+extern TransistHost* transist_host;
 
 // Cleared when the writer ends early (a file could not be reopened): the
 // reader then drops data instead of queueing it for nobody.
@@ -55,7 +57,3 @@ void* write_thread(void*);
 // Sanitised tuning values; each records what it replaced.
 int choose_capacity(const char* value);
 int choose_interval(const char* value);
-
-// Copies src into dst (size n) with control and non-ASCII bytes shown as '?',
-// so that outside input never breaks a one-line record.
-void printable_copy(char* dst, int n, const char* src);

@@ -8,11 +8,9 @@
 #include <sys/prctl.h>
 #include <unistd.h>
 
+#include "common/control_protocol.h"
 #include "common/io_util.h"
-#include "common/wlog.h"
-#include "core/control_socket.h"
-#include "core/log_controller.h"
-#include "storage/history_log.h"
+#include "record/record.h"
 #include "storage/storage_check.h"
 #include "transist/log_files.h"
 #include "transist/transist.h"
@@ -20,18 +18,10 @@
 #include "transist/transist_reader.h"
 #include "transist/transist_state.h"
 
-static void notify_controller(uint64_t value) {
-    if (efd_thread < 0) return;
-    RETRY_EINTR(write(efd_thread, &value, sizeof(value)));
-}
-
-int writer_storage_blocked(LogController* controller, int (*is_low)(const char*), bool notify) {
-    if (controller == nullptr || is_low(controller->current_log_root()) != 1) return 0;
+int writer_storage_blocked(TransistHost* host, int (*is_low)(const char*), bool notify) {
+    if (host == nullptr || is_low(host->space_root()) != 1) return 0;
     HLOG(TAG_TRANSIST, WLOG_ERROR, "no space to write log");
-    if (notify) {
-        reply_client(controller, -1, "storage_full");
-        notify_controller(EVENT_STORAGE_LOW);
-    }
+    if (notify) host->writer_gave_up(BROADCAST_STORAGE_FULL, EVENT_STORAGE_LOW);
     return 1;
 }
 
@@ -82,22 +72,20 @@ int flush_one_queue(TransistQueue* q, bool notify) {
                     continue;
                 }
                 HLOG(TAG_TRANSIST, WLOG_ERROR, "log files %s not exist:%d", entry->name, err);
-                if (notify) {
-                    reply_client(transist_controller, -1, "log_folder_lost");
-                    notify_controller(EVENT_FOLDER_LOST);
+                if (notify && transist_host != nullptr) {
+                    transist_host->writer_gave_up(BROADCAST_FOLDER_LOST, EVENT_FOLDER_LOST);
                 }
                 return FLUSH_FOLDER_LOST;
             }
             LogBuffer* node = list->head;
             // The same root as the check at the start of a cycle; the
-            // controller resets it only after the writer has ended.
-            const char* root = transist_controller ? transist_controller->current_log_root() : entry->name;
+            // host changes it only after the writer has ended.
+            const char* root = transist_host ? transist_host->space_root() : entry->name;
             if (!room_for_node(&budget, root, node->len)) {
                 HLOG(TAG_UTIL, WLOG_ERROR, "%s is almost full or unavailable!!", root);
                 HLOG(TAG_TRANSIST, WLOG_ERROR, "no space to write log");
-                if (notify) {
-                    reply_client(transist_controller, -1, "storage_full");
-                    notify_controller(EVENT_STORAGE_LOW);
+                if (notify && transist_host != nullptr) {
+                    transist_host->writer_gave_up(BROADCAST_STORAGE_FULL, EVENT_STORAGE_LOW);
                 }
                 return FLUSH_STORAGE_LOW;
             }
@@ -156,7 +144,7 @@ void* write_thread(void*) {
     const int64_t interval_us = static_cast<int64_t>(transist_interval) * 1000000;
     writer_sleep_us(interval_us);
     while (!stop_requested) {
-        if (writer_storage_blocked(transist_controller, is_storage_low, true)) {
+        if (writer_storage_blocked(transist_host, is_storage_low, true)) {
             writer_sleep_us(interval_us);
             continue;
         }

@@ -60,7 +60,7 @@ pid_t start_emu(const std::vector<std::string>& args, int* in_fd = nullptr, int*
 int run_emu(const std::vector<std::string>& args) {
     int status = 0;
     pid_t pid = start_emu(args);
-    return pid > 0 && RETRY_EINTR(waitpid(pid, &status, 0)) == pid ? exit_code(status) : -1;
+    return pid > 0 && TEMP_FAILURE_RETRY(waitpid(pid, &status, 0)) == pid ? exit_code(status) : -1;
 }
 
 bool under(const std::string& path, const std::string& folder) {
@@ -95,7 +95,7 @@ bool EmuProcess::read_until(const std::string& needle, int timeout_ms) {
         if (rc < 0 && errno == EINTR) continue;
         if (rc <= 0) return false;
         char buf[8192];
-        ssize_t n = RETRY_EINTR(read(out_, buf, sizeof(buf)));
+        ssize_t n = TEMP_FAILURE_RETRY(read(out_, buf, sizeof(buf)));
         if (n <= 0) {
             close(out_);
             out_ = -1;
@@ -206,7 +206,7 @@ std::string EmuPhone::read_file(const std::string& device_path) const {
     std::string text;
     int fd = open(host_path(device_path).c_str(), O_RDONLY | O_CLOEXEC);
     char buf[8192];
-    for (ssize_t n; fd >= 0 && (n = RETRY_EINTR(read(fd, buf, sizeof(buf)))) > 0;) text.append(buf, static_cast<size_t>(n));
+    for (ssize_t n; fd >= 0 && (n = TEMP_FAILURE_RETRY(read(fd, buf, sizeof(buf)))) > 0;) text.append(buf, static_cast<size_t>(n));
     if (fd >= 0) close(fd);
     return text;
 }

@@ -1,5 +1,5 @@
 // Fork wrappers: one collector process each.
-#include "collectors/fork_collectors.h"
+#include "core/fork_collectors.h"
 
 #include <errno.h>
 #include <signal.h>
@@ -7,13 +7,13 @@
 #include <string.h>
 #include <unistd.h>
 
-#include "collectors/collector_link.h"
 #include "collectors/bt_cat.h"
+#include "collectors/collector_link.h"
 #include "collectors/kmsg_cat.h"
 #include "collectors/log_cat.h"
 #include "common/log_types.h"
-#include "common/wlog.h"
 #include "core/log_controller.h"
+#include "record/record.h"
 #include "storage/history_log.h"
 #include "transist/transist.h"
 
@@ -31,13 +31,7 @@ static void collector_child_setup(LogController* controller) {
     history_log_after_fork();
     collector_daemon_pid = getppid();
 
-    // The tables may be mid-update by the daemon's threads at the fork; the
-    // child only reads its own copy and owns no lock.
-    for (LogFile& file : log_files) {
-        close_if_open(&file.fd);
-        close_if_open(&file.sock);
-    }
-    close_if_open(&transist_listen_fd);
+    transist_close_in_child();
     if (controller != nullptr) {
         close_if_open(&controller->listen_fd);
         for (ClientSlot& slot : controller->clients) close_if_open(&slot.fd);
@@ -100,7 +94,7 @@ int fork_kernel_log(LogController* controller, int block_fd) {
         HLOG(TAG_MAIN, WLOG_ERROR, "fork kernelLog failed %s", strerror(err));
         return -1;
     }
-    controller->klog_pid = pid;
+    controller->collector_pid[LOG_KERNEL] = pid;
     WLOG(TAG_MAIN, WLOG_DEBUG, "kmsgcat pid = %d", pid);
     return 0;
 }
@@ -111,7 +105,7 @@ int fork_main_log(LogController* controller, int block_fd) {
         HLOG(TAG_MAIN, WLOG_ERROR, "fork mainLog failed %s", strerror(errno));
         return -1;
     }
-    controller->mlog_pid = pid;
+    controller->collector_pid[LOG_MAIN] = pid;
     WLOG(TAG_MAIN, WLOG_DEBUG, "logcat main pid = %d", pid);
     return 0;
 }
@@ -122,7 +116,7 @@ int fork_radio_log(LogController* controller, int block_fd) {
         HLOG(TAG_MAIN, WLOG_ERROR, "fork radiolog failed %s", strerror(errno));
         return -1;
     }
-    controller->rlog_pid = pid;
+    controller->collector_pid[LOG_RADIO] = pid;
     WLOG(TAG_MAIN, WLOG_DEBUG, "logcat radio pid = %d", pid);
     return 0;
 }
@@ -133,7 +127,7 @@ int fork_events_log(LogController* controller, int block_fd) {
         HLOG(TAG_MAIN, WLOG_ERROR, "fork eventsLog failed %s", strerror(errno));
         return -1;
     }
-    controller->elog_pid = pid;
+    controller->collector_pid[LOG_EVENTS] = pid;
     WLOG(TAG_MAIN, WLOG_DEBUG, "logcat events pid = %d", pid);
     return 0;
 }
@@ -144,7 +138,7 @@ int fork_bt_log(LogController* controller, int block_fd) {
         HLOG(TAG_MAIN, WLOG_ERROR, "fork btLog failed %s", strerror(errno));
         return -1;
     }
-    controller->blog_pid = pid;
+    controller->collector_pid[LOG_BT] = pid;
     WLOG(TAG_MAIN, WLOG_DEBUG, "btcat pid = %d", pid);
     return 0;
 }

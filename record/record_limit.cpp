@@ -1,12 +1,6 @@
-#include "storage/record_limit.h"
+#include "record/record_limit.h"
 
-#include <time.h>
-
-static long long now_ms() {
-    struct timespec ts;
-    clock_gettime(CLOCK_MONOTONIC, &ts);
-    return static_cast<long long>(ts.tv_sec) * 1000 + ts.tv_nsec / 1000000;
-}
+#include "common/clock.h"
 
 // Opens a new window when the current one has passed; the caller that wins
 // the exchange writes the summary (and its own record).
@@ -22,7 +16,7 @@ static void write_summary(RecordLimit* limit) {
 }
 
 bool record_limit_pass(RecordLimit* limit) {
-    if (!take_window(limit, now_ms())) {
+    if (!take_window(limit, monotonic_ms())) {
         limit->held.fetch_add(1);
         return false;
     }
@@ -32,7 +26,7 @@ bool record_limit_pass(RecordLimit* limit) {
 
 int record_limit_flush(RecordLimit* limit) {
     if (limit->held.load() == 0) return -1;
-    long long now = now_ms();
+    long long now = monotonic_ms();
     long long left = limit->next_ms.load() - now;
     if (left > 0) return static_cast<int>(left);
     if (take_window(limit, now)) write_summary(limit);

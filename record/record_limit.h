@@ -13,7 +13,7 @@
 
 #include <atomic>
 
-#include "common/wlog.h"
+#include "record/record.h"
 
 constexpr int RECORD_LIMIT_MS = 5000;
 
