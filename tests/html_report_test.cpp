@@ -1,16 +1,15 @@
 // The HTML report: hostile text escaped byte for byte, and the page itself
 // loaded in headless Chromium with filters from its URL fragment.
 #include <gtest/gtest.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
-#include <cstdio>
 #include <filesystem>
 #include <fstream>
+#include <iterator>
 #include <regex>
 #include <string>
 #include <vector>
 
+#include "tests/chromium.h"
 #include "tools/tavlolog/html_report.h"
 #include "tools/tavlolog/report_text.h"
 
@@ -25,23 +24,23 @@ const char HOSTILE[] =
 
 TEST(ReportText, MakesHostileTextSafeAndVisible) {
     struct Row {
-        std::string in, js, html;
+        std::string in, visible, html;
     } rows[] = {
-        {"</script><!--", "\\x3c/script>\\x3c!--", "&lt;/script&gt;&lt;!--"},
-        {"a\"b\\c'&", "a\\\"b\\\\c'&", "a&quot;b\\c&#39;&amp;"},
+        {"</script><!--", "</script><!--", "&lt;/script&gt;&lt;!--"},
+        {"a\"b\\c'&", "a\"b\\c'&", "a&quot;b\\c&#39;&amp;"},
         {std::string("\0\n\r\x1b\x7f", 5), "\u2400\u240a\u240d\u241b\u2421", "\u2400\u240a\u240d\u241b\u2421"},
-        {"a\tb", "a\\tb", "a\tb"},
-        {"\u2028\u2029", "\\u2028\\u2029", "\u2028\u2029"},
+        {"a\tb", "a\tb", "a\tb"},
+        {"\u2028\u2029", "\u2028\u2029", "\u2028\u2029"},
         {"\xff|\xc3|\xc0\xaf|\xed\xa0\x80|\xf4\x90\x80\x80|\xe2\x82",
          "\ufffd|\ufffd|\ufffd\ufffd|\ufffd\ufffd\ufffd|\ufffd\ufffd\ufffd\ufffd|\ufffd\ufffd",
          "\ufffd|\ufffd|\ufffd\ufffd|\ufffd\ufffd\ufffd|\ufffd\ufffd\ufffd\ufffd|\ufffd\ufffd"},
         {"\u00e9\u20ac\U0001F600\U0010FFFF", "\u00e9\u20ac\U0001F600\U0010FFFF", "\u00e9\u20ac\U0001F600\U0010FFFF"},
     };
     for (const Row& r : rows) {
-        std::string js, html;
-        append_js_text(js, r.in);
+        std::string visible, html;
+        append_visible_text(visible, r.in);
         append_html_text(html, r.in);
-        EXPECT_EQ(js, r.js) << r.in;
+        EXPECT_EQ(visible, r.visible) << r.in;
         EXPECT_EQ(html, r.html) << r.in;
     }
 }
@@ -49,7 +48,7 @@ TEST(ReportText, MakesHostileTextSafeAndVisible) {
 // A run in time order: a held boot, then the run with every source, a line
 // of a boot without wall-clock time and a hostile app's line.
 struct Line {
-    int64_t ms;  // after the run's first instant; since boot when !instant
+    int64_t ms;  // after the run's first instant; else a kernel line's time since boot
     bool instant;
     Source src;
     Kind kind;
@@ -71,8 +70,8 @@ const Line RUN[] = {
     {61000, true, SRC_EVENTS, KIND_LINE, 6, 1000, 1000, "am_proc_start", "[0,4242,10087,com.example.app,activity]", "events_log", 0, ""},
     {61200, true, SRC_KERNEL, KIND_LINE, 4, -1, -1, "", "wlan0: link down", "kernel_log", 0, ""},
     {61300, true, SRC_MAIN, KIND_LINE, 6, 1000, 1090, "WifiStateMachine", "WIFI connected to tavlo-net", "main_log", 0, ""},
-    {62000, true, SRC_BT, KIND_LINE, PRIO_NONE, -1, -1, "", "HCI: LE Advertising Report", "bt_log", 0, ""},
-    {62000, true, SRC_BT, KIND_HEX, PRIO_NONE, -1, -1, "", "[6 bytes] 04 3e 0c 02 01 00", "bt_log", 0, ""},
+    {0, false, SRC_BT, KIND_LINE, PRIO_NONE, -1, -1, "", "HCI: LE Advertising Report", "bt_log", 0, ""},
+    {0, false, SRC_BT, KIND_HEX, PRIO_NONE, -1, -1, "", "[6 bytes] 04 3e 0c 02 01 00", "bt_log", 0, ""},
     {63000, true, SRC_MAIN, KIND_MALFORMED, PRIO_NONE, -1, -1, "", "03-04 07:07 garbled\x01", "main_log", 0, ""},
     {64000, true, SRC_MAIN, KIND_LINE, 3, 4242, 4242, "chatty", std::string(HOSTILE, sizeof HOSTILE - 1), "main_log", 0, ""},
     {65000, true, SRC_RADIO, KIND_LINE, 6, 1523, 1530, "wifi", "Wifi scan: 3 networks", "radio_log", 0, ""},
@@ -94,6 +93,7 @@ void write_report(const fs::path& path) {
         Entry e{};
         e.instant_ns = (l.instant ? RUN_START_NS : 0) + l.ms * 1000000;
         e.has_instant = l.instant;
+        e.uptime_ns = !l.instant && l.src == SRC_KERNEL ? e.instant_ns : -1;
         e.utc_offset_s = 3600;
         e.source = l.src;
         e.kind = l.kind;
@@ -111,46 +111,26 @@ void write_report(const fs::path& path) {
     ASSERT_EQ(report.close(), 0);
 }
 
-std::string chromium() {
-    for (const char* name : {"chromium", "chromium-browser", "google-chrome"}) {
-        std::string cmd = std::string("command -v ") + name + " >/dev/null 2>&1";
-        if (system(cmd.c_str()) == 0) return name;
-    }
-    return "";
-}
-
-std::string quoted(const std::string& s) {
-    std::string q = "'";
-    for (char c : s) q += c == '\'' ? std::string("'\\''") : std::string(1, c);
-    return q + "'";
-}
-
-// Loads the report in headless Chromium and returns the DOM once its scripts ran.
-std::string load(const std::string& browser, const fs::path& page, const std::string& fragment,
-                 const std::string& extra) {
-    const fs::path profile = out_dir() / "profile";
-    std::string cmd = "timeout 60 " + browser +
-                      " --headless --disable-gpu --no-sandbox --no-first-run --hide-scrollbars"
-                      " --window-size=1280,860 --virtual-time-budget=1000 --user-data-dir=" +
-                      quoted(profile) + " " + extra + " " + quoted("file://" + page.string() + "#" + fragment) +
-                      " 2>>" + quoted(out_dir() / "chromium.log");
-    std::string dom;
-    FILE* p = popen(cmd.c_str(), "r");
-    if (!p) return dom;
-    char buf[65536];
-    for (size_t n; (n = fread(buf, 1, sizeof buf, p)) > 0;) dom.append(buf, n);
-    pclose(p);
-    return dom;
-}
-
-int shown(const std::string& dom) {
-    std::smatch m;
-    return std::regex_search(dom, m, std::regex("data-shown=\"(\\d+)\"")) ? std::stoi(m[1]) : -1;
+// Whatever the apps wrote, the page's data is base 64 in data scripts, then
+// the call that starts the page: nothing in it can end a script or open markup.
+TEST(HtmlReport, DataHoldsNothingButBase64) {
+    const fs::path page = out_dir() / "data.html";
+    write_report(page);
+    std::ifstream in(page, std::ios::binary);
+    const std::string html((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+    const size_t data = html.find("<script>Z(\""), tail = html.rfind("<script>done(");
+    ASSERT_NE(data, std::string::npos);
+    ASSERT_NE(tail, std::string::npos);
+    EXPECT_TRUE(std::regex_match(html.substr(data, tail - data),
+                                 std::regex("(<script>Z\\(\"[A-Za-z0-9+/]*={0,2}\"\\)</script>\\n)+")));
+    EXPECT_EQ(html.substr(tail, html.find('\n', tail) - tail), "<script>done(" + std::to_string(std::size(RUN)) + ")</script>");
+    EXPECT_EQ(html.find("alert(1)"), std::string::npos);
 }
 
 TEST(HtmlReport, LoadsInChromiumWithLanesBootsAndFilters) {
-    const std::string browser = chromium();
-    if (browser.empty()) GTEST_SKIP() << "no chromium (tools/install-deps.sh installs it)";
+    std::string why;
+    const std::string browser = chromium(&why);
+    if (browser.empty()) GTEST_SKIP() << why;
     const fs::path page = out_dir() / "report.html";
     write_report(page);
 
@@ -161,9 +141,10 @@ TEST(HtmlReport, LoadsInChromiumWithLanesBootsAndFilters) {
     } cases[] = {
         {"", 16,
          {"data-total=\"16\"", "data-src=\"K\"", "data-src=\"M\"", "data-src=\"S\"", "data-src=\"R\"",
-          "data-src=\"E\"", "data-src=\"B\"", "data-src=\"K0\"", ">boot -1 \u00b7 hbr</option>", ">run</option>",
+          "data-src=\"E\"", "data-src=\"B\"", "data-src=\"K0\"",
+          "kernel<span>2</span>", "since boot<span>1</span>", "bluetooth<span>2</span>", ">boot -1 \u00b7 hbr</option>", ">run</option>",
           "APLog_2026_0304_070649 &lt;b&gt;&amp;", "class=\"c-m\">Displayed com.android.settings/.Settings: +412ms<",
-          "03-04 07:07:51.000", "[    1.234000]"},
+          "03-04 07:07:52.000", "[    1.234000]"},
          {}},
         {"q=alert(1)", 1,
          {"class=\"c-m\">&lt;/script&gt;&lt;script&gt;alert(1)&lt;/script&gt;&lt;script&gt;document.body.dataset."
@@ -179,10 +160,10 @@ TEST(HtmlReport, LoadsInChromiumWithLanesBootsAndFilters) {
     const fs::path png = out_dir() / "report.png";
     fs::remove(png);
     for (const Case& c : cases) {
-        const std::string extra = c.fragment.empty() ? "--screenshot=" + quoted(png) : "";
-        const std::string dom = load(browser, page, c.fragment, "--dump-dom " + extra);
+        const std::string extra = c.fragment.empty() ? "--screenshot=" + shell_quoted(png) : "";
+        const std::string dom = load_in_chromium(browser, page, c.fragment, extra, out_dir());
         ASSERT_NE(dom.find("data-ready=\"1\""), std::string::npos) << c.fragment << "\n" << dom.substr(std::min(dom.size(), dom.find("<body")), 2000);
-        EXPECT_EQ(shown(dom), c.shown) << c.fragment;
+        EXPECT_EQ(page_number(dom, "data-shown"), c.shown) << c.fragment;
         for (const std::string& s : c.present) EXPECT_NE(dom.find(s), std::string::npos) << c.fragment << ": " << s;
         for (const std::string& s : c.absent) EXPECT_EQ(dom.find(s), std::string::npos) << c.fragment << ": " << s;
     }

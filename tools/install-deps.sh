@@ -17,12 +17,12 @@ sudo=""
 
 pkgs=(build-essential cmake ninja-build pkg-config bubblewrap util-linux procps
       libgtest-dev libgmock-dev android-liblog-dev android-libcutils-dev libfuse3-dev fuse3
-      chromium tzdata less)
+      zlib1g-dev chromium tzdata less)
 if [ $arm = 1 ]; then
     # Not crossbuild-essential-armhf: it would upgrade the host's perl.
     pkgs+=(g++-arm-linux-gnueabihf qemu-user-static
            android-liblog-dev:armhf android-libcutils-dev:armhf libgtest-dev:armhf libgmock-dev:armhf
-           libfuse3-dev:armhf libasan8:armhf libubsan1:armhf)
+           libfuse3-dev:armhf zlib1g-dev:armhf libasan8:armhf libubsan1:armhf)
 fi
 
 missing=()

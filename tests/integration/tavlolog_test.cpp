@@ -4,10 +4,14 @@
 #include <time.h>
 
 #include <algorithm>
+#include <cctype>
 #include <cstdio>
+#include <filesystem>
+#include <regex>
 #include <string>
 #include <vector>
 
+#include "tests/chromium.h"
 #include "tests/integration/log_daemon.h"
 #include "tools/tavlolog/output.h"
 #include "tools/tavlolog/run_folder.h"
@@ -24,16 +28,26 @@ struct Seen {
 struct Collect : tavlolog::Sink {
     std::vector<Seen> seen;
     size_t entries = 0;
+    size_t per_source[tavlolog::SRC_COUNT] = {};
+    std::vector<std::string> messages;
     void entry(const tavlolog::Entry& e) override {
         entries++;
+        per_source[e.source]++;
+        messages.emplace_back(e.message);
         if (e.kind == tavlolog::KIND_LINE)
             seen.push_back({tavlolog::SOURCE_LETTER[e.source], e.has_instant ? e.instant_ns : -1, std::string(e.tag),
                             std::string(e.message)});
     }
 };
 
-TEST(TavlologOnARecordedRun, MergesEveryLineInTheOrderOfItsInstant) {
-    EmuPhone phone;
+// A run recorded on a phone with lines written at known instants on every source.
+struct Recorded {
+    std::string folder;                           // on the host
+    int64_t base = 0;                             // the first line's instant
+    std::vector<std::pair<int64_t, char>> want;   // each line's instant and source
+};
+
+void record_run(EmuPhone& phone, Recorded* run) {
     ASSERT_TRUE(phone.boot());
     ASSERT_TRUE(ctl(phone, "start"));
     std::string folder = run_folder(phone);
@@ -46,9 +60,10 @@ TEST(TavlologOnARecordedRun, MergesEveryLineInTheOrderOfItsInstant) {
     const char* const order = "MSREK";
     struct timespec now;
     clock_gettime(CLOCK_REALTIME, &now);
-    int64_t base = (static_cast<int64_t>(now.tv_sec) + 1) * 1000000000;
+    const int64_t base = (static_cast<int64_t>(now.tv_sec) + 1) * 1000000000;
+    run->base = base;
     const int kLines = 20;
-    std::vector<std::pair<int64_t, char>> want;
+    std::vector<std::pair<int64_t, char>>& want = run->want;
     std::string kmsg;
     for (const char* s = order; *s; s++) {
         for (int i = static_cast<int>(s - order); i < kLines; i += 5) {
@@ -78,13 +93,20 @@ TEST(TavlologOnARecordedRun, MergesEveryLineInTheOrderOfItsInstant) {
                count(phone.read_file(folder + "events_log"), "tavlo_demo_long") == 4;
     }));
     ASSERT_TRUE(ctl(phone, "stop"));
+    std::sort(want.begin(), want.end());
+    run->folder = phone.host_path(folder);
+}
 
-    std::vector<std::string> runs = tavlolog::find_runs({phone.host_path(folder)});
+TEST(TavlologOnARecordedRun, MergesEveryLineInTheOrderOfItsInstant) {
+    EmuPhone phone;
+    Recorded run;
+    ASSERT_NO_FATAL_FAILURE(record_run(phone, &run));
+    const std::vector<std::pair<int64_t, char>>& want = run.want;
+    std::vector<std::string> runs = tavlolog::find_runs({run.folder});
     ASSERT_EQ(1u, runs.size());
     tavlolog::Filter all;
     Collect got;
     tavlolog::read_timeline(runs, all, &got);
-    std::sort(want.begin(), want.end());
     std::vector<std::pair<int64_t, char>> written;
     std::vector<std::string> bt;
     for (const Seen& s : got.seen) {
@@ -125,12 +147,59 @@ TEST(TavlologOnARecordedRun, MergesEveryLineInTheOrderOfItsInstant) {
     fclose(in);
     unlink(path);
     EXPECT_EQ(got.entries, lines);
-    time_t first = static_cast<time_t>(base / 1000000000);
+    time_t first = static_cast<time_t>(run.base / 1000000000);
     struct tm tm;
     gmtime_r(&first, &tm);
     char stamp[64];
     strftime(stamp, sizeof(stamp), "\"time\":\"%Y-%m-%dT%H:%M:%S.000000000Z\"", &tm);
     EXPECT_TRUE(contains(text, std::string(stamp) + ",\"inherited\":false,\"uptime\":null,\"source\":\"main\"")) << stamp;
+}
+
+// The program's HTML report of that run, as a user opens it: every entry and
+// lane there, and a search from the URL fragment narrows the list.
+TEST(TavlologOnARecordedRun, ItsHtmlReportShowsEveryEntryAndLaneInChromium) {
+    std::string why;
+    const std::string browser = chromium(&why);
+    if (browser.empty()) GTEST_SKIP() << why;
+    EmuPhone phone;
+    Recorded run;
+    ASSERT_NO_FATAL_FAILURE(record_run(phone, &run));
+    const std::filesystem::path out = std::filesystem::path(TAVLO_BUILD_DIR) / "test-output" / "tavlolog_run";
+    std::filesystem::create_directories(out);
+    const std::filesystem::path page = out / "report.html", png = out / "report.png";
+    std::filesystem::remove(png);
+    const std::string cmd = std::string(TAVLO_BUILD_DIR) + "/tools/tavlolog/tavlolog --html " +
+                            shell_quoted(page) + " " + shell_quoted(run.folder);
+    ASSERT_EQ(0, system(cmd.c_str())) << cmd;
+
+    // What the reader finds in the folder is what the page must show.
+    Collect got;
+    tavlolog::read_timeline(tavlolog::find_runs({run.folder}), tavlolog::Filter(), &got);
+    const std::string query = "n=1";  // n=1, n=10 ... n=19 but the events lines (values "l:13", "l:18")
+    long found = 0;
+    for (std::string m : got.messages) {
+        std::transform(m.begin(), m.end(), m.begin(), [](unsigned char c) { return std::tolower(c); });
+        found += contains(m, query);
+    }
+    ASSERT_GE(found, 9);
+
+    std::string dom = load_in_chromium(browser, page, "", "--screenshot=" + shell_quoted(png), out);
+    ASSERT_TRUE(contains(dom, "data-ready=\"1\"")) << dom.substr(0, 4000);
+    EXPECT_EQ(static_cast<long>(got.entries), page_number(dom, "data-total"));
+    EXPECT_EQ(static_cast<long>(got.entries), page_number(dom, "data-shown"));
+    for (int s = 0; s < tavlolog::SRC_COUNT; s++) {
+        // The lane's label: its letter, its name and how many entries it shows.
+        const std::string lane = std::string("data-src=\"") + tavlolog::SOURCE_LETTER[s] + "\"";
+        std::smatch m;
+        ASSERT_TRUE(std::regex_search(dom, m, std::regex(lane + "[^>]*>.*?<span>([0-9,]+)</span>"))) << lane;
+        EXPECT_EQ(std::to_string(got.per_source[s]), m[1].str()) << lane;
+    }
+    EXPECT_TRUE(std::filesystem::exists(png));
+
+    dom = load_in_chromium(browser, page, "q=n%3D1", "", out);
+    EXPECT_EQ(found, page_number(dom, "data-shown"));
+    EXPECT_TRUE(contains(dom, ">n=14<")) << dom.substr(0, 4000);
+    EXPECT_FALSE(contains(dom, ">n=2<"));
 }
 
 }  // namespace

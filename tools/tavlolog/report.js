@@ -1,5 +1,7 @@
-// The merged timeline of a run, drawn from the columns the report's data
-// scripts hand to C(); done() starts the page once the last one has run.
+// The merged timeline of a run. The report's data scripts hand Z() the pieces
+// of one raw deflate stream in base 64; the browser inflates it while the page
+// still parses, each chunk of entries decoded into columns as it comes out.
+// done() starts the page once the stream has ended.
 // Only what is on screen is drawn: the timeline and histogram are canvases,
 // the entry list is a pool of rows refilled on scroll.
 "use strict";
@@ -39,12 +41,11 @@ function grow(need) {
     cap = c;
 }
 
-// One chunk of entries: N columns as base-64 VLQ numbers in COLS, the
+// One chunk of entries: N entries' numbers as base-64 VLQ values in COLS, the
 // messages in MSGS, the tags, file names and boot names first used in it.
-let firstDataMs = -1, decodeMs = 0;
+let firstDataMs = -1, parsedMs = -1, decodeMs = 0;
 function C(n, cols, msgs, newTags, newFiles, newBoots) {
     const t0 = performance.now();
-    if (firstDataMs < 0) firstDataMs = t0;
     for (const t of newTags) tags.push(t);
     grow(N + n);
     let p = 0, fi = 0, bi = 0;
@@ -61,11 +62,12 @@ function C(n, cols, msgs, newTags, newFiles, newBoots) {
         const e = N + k;
         const h = v();
         const x = h & 1 ? v() : 0;
-        const src = (h >> 1) & 7, rel = (x >> 3) & 1;
-        const t = dec.us[rel] + zz(v());
-        dec.us[rel] = t;
+        // Bit 7: no time at all (Bluetooth bytes, a marker before any timed line).
+        const src = (h >> 1) & 7, rel = (x >> 3) & 1, none = x >> 7;
+        const t = none ? 0 : dec.us[rel] + zz(v());
+        if (!none) dec.us[rel] = t;
         const pid = v() - 1;
-        TM[e] = t; SK[e] = src | rel << 3 | (x & 7) << 4; PR[e] = (h >> 4) - 1;
+        TM[e] = t; SK[e] = src | rel << 3 | (x & 7) << 4 | none << 7; PR[e] = (h >> 4) - 1;
         PID[e] = pid; TID[e] = pid + zz(v()); TAG[e] = v();
         if (x & 16) {
             const f = newFiles[fi++];
@@ -85,21 +87,72 @@ function C(n, cols, msgs, newTags, newFiles, newBoots) {
         BOOT[e] = dec.boot; TZ[e] = dec.tz;
         const bo = boots[dec.boot];
         bo.n++;
-        if (!rel) { if (t < bo.first) bo.first = t; if (t > bo.last) bo.last = t; }
+        if (!rel && !none) { if (t < bo.first) bo.first = t; if (t > bo.last) bo.last = t; }
         MO[e] = mo; CH[e] = ch;
         if (k < n - 1) mo = msgs.indexOf("\n", mo) + 1;
     }
     N += n;
     decodeMs += performance.now() - t0;
-    document.currentScript && document.currentScript.remove();  // its text is decoded: let it go
 }
+
+// The stream: pieces in, chunks out. A chunk is a line "N TAGS FILES BOOTS
+// BYTES", then BYTES of UTF-8: the numbers, a line feed, the new names one per
+// line, the messages separated by line feeds.
+const inflater = typeof DecompressionStream === "function" ? new DecompressionStream("deflate-raw") : null;
+const pieces = inflater && inflater.writable.getWriter();
+const fromBase64 = Uint8Array.fromBase64 ? s => Uint8Array.fromBase64(s) : s => {
+    const b = atob(s), a = new Uint8Array(b.length);
+    for (let i = 0; i < b.length; i++) a[i] = b.charCodeAt(i);
+    return a;
+};
+function Z(b64) {
+    if (firstDataMs < 0) firstDataMs = performance.now();
+    if (pieces) pieces.write(fromBase64(b64)).catch(() => {});  // a broken stream shows where it is read
+    document.currentScript && document.currentScript.remove();  // its text is taken: let it go
+}
+async function readChunks(reader) {
+    const utf8 = new TextDecoder();
+    let buf = new Uint8Array(1 << 20), have = 0;
+    for (;;) {
+        const { value, done } = await reader.read();
+        if (done) break;
+        if (have + value.length > buf.length) {
+            const b = new Uint8Array(Math.max(buf.length * 2, have + value.length));
+            b.set(buf.subarray(0, have)); buf = b;
+        }
+        buf.set(value, have); have += value.length;
+        let at = 0;
+        for (;;) {
+            const nl = buf.subarray(at, have).indexOf(10);
+            if (nl < 0) break;
+            const head = utf8.decode(buf.subarray(at, at + nl)).split(" ").map(Number);
+            const start = at + nl + 1, end = start + head[4];
+            if (head.length !== 5 || !(end >= start)) throw new Error("a chunk's header is damaged");
+            if (end > have) break;
+            const body = utf8.decode(buf.subarray(start, end));
+            let p = body.indexOf("\n");
+            const cols = body.substring(0, p), names = [];
+            for (let k = head[1] + head[2] + head[3]; k > 0; k--) {
+                const q = body.indexOf("\n", p + 1);
+                names.push(body.substring(p + 1, q)); p = q;
+            }
+            const f = head[1], b = f + head[2];
+            C(head[0], cols, body.substring(p + 1), names.slice(0, f), names.slice(f, b), names.slice(b));
+            at = end;
+        }
+        buf.copyWithin(0, at, have); have -= at;
+    }
+    if (have) throw new Error("the data ends inside a chunk");
+}
+const chunksRead = inflater ? readChunks(inflater.readable.getReader()) : null;
+$("count").textContent = "loading\u2026";
 
 function message(e) {
     const s = chunks[CH[e]];
     const end = e + 1 < N && CH[e + 1] === CH[e] ? MO[e + 1] - 1 : s.length;
     return s.substring(MO[e], end);
 }
-const src = e => SK[e] & 7, isRel = e => (SK[e] >> 3) & 1, kind = e => SK[e] >> 4;
+const src = e => SK[e] & 7, isRel = e => (SK[e] >> 3) & 1, kind = e => (SK[e] >> 4) & 7, untimed = e => SK[e] >> 7;
 
 // ---- filters ---------------------------------------------------------------
 let sel = new Int32Array(0);   // shown entries, in the order of the run
@@ -159,7 +212,7 @@ function applyFilters() {
     sel = out.subarray(0, n);
     let w = 0, r = 0;
     const W = new Int32Array(n), R = new Int32Array(n);
-    for (let i = 0; i < n; i++) { const e = sel[i]; if (isRel(e)) R[r++] = e; else W[w++] = e; }
+    for (let i = 0; i < n; i++) { const e = sel[i]; if (untimed(e)) continue; if (isRel(e)) R[r++] = e; else W[w++] = e; }
     selW = W.subarray(0, w); selR = R.subarray(0, r);
 }
 
@@ -178,7 +231,7 @@ function fmtWall(us, tz, withYear, digits) {
         " " + pad(d.getUTCHours(), 2) + ":" + pad(d.getUTCMinutes(), 2) + ":" + pad(d.getUTCSeconds(), 2) + "." + frac;
 }
 const fmtRel = us => "[" + (us / 1e6).toFixed(6).padStart(12) + "]";
-const fmtTime = e => (isRel(e) ? fmtRel(TM[e]) : fmtWall(TM[e], TZ[e], false, 3));
+const fmtTime = e => (untimed(e) ? "" : isRel(e) ? fmtRel(TM[e]) : fmtWall(TM[e], TZ[e], false, 3));
 const bootLabel = b => (b.boot === 0 ? "run" : "boot " + b.boot + (b.name ? " \u00b7 " + b.name : ""));
 
 // ---- the entry list ----------------------------------------------------------
@@ -263,6 +316,7 @@ function select(e) {
     const meta = document.createElement("div");
     meta.className = "meta";
     meta.textContent = [
+        untimed(e) ? "no time of its own" :
         isRel(e) ? (TM[e] / 1e6).toFixed(6) + " s since boot (no wall-clock time for this boot)"
                  : fmtWall(TM[e], TZ[e], true, 6) + " " + fmtZone(TZ[e]),
         SRC_NAME[src(e)], p >= 0 ? PRIO_NAME[p] + " (" + p + ")" : "no priority",
@@ -376,7 +430,7 @@ function marker(g, v, w, t, y0, y1, color) {
 function markers(g, w, y0, y1, rel) {
     const at = sel.length ? sel[Math.min(topRow, sel.length - 1)] : -1;
     for (const [e, c] of [[at, "#0969da"], [selected, "#d4a72c"]]) {
-        if (e >= 0 && isRel(e) === rel) marker(g, rel ? view.r : view.w, w, TM[e], y0, y1, c);
+        if (e >= 0 && !untimed(e) && isRel(e) === rel) marker(g, rel ? view.r : view.w, w, TM[e], y0, y1, c);
     }
 }
 
@@ -510,7 +564,7 @@ function jumpTo(d, t, pick) {
 }
 // The timeline follows the list: the entry at the top of the list stays in view.
 function follow() {
-    if (!sel.length) return;
+    if (!sel.length || untimed(sel[Math.min(topRow, sel.length - 1)])) return;
     const e = sel[Math.min(topRow, sel.length - 1)], d = isRel(e) ? "r" : "w", v = view[d], t = TM[e];
     if (t >= v[0] && t <= v[1]) return;
     const span = v[1] - v[0];
@@ -657,14 +711,24 @@ function buildControls() {
     });
 }
 
-// The last data script has run: TOTAL entries were written.
+// The last data script has run: TOTAL entries were written. The page starts
+// once the stream has ended (or broke: then with what came before).
 function done(total) {
+    parsedMs = performance.now();
+    if (!chunksRead) { $("warn").textContent = "this browser cannot inflate the report (no DecompressionStream)"; return; }
+    pieces.close().catch(() => {});
+    chunksRead.then(() => start(total), err => {
+        $("warn").textContent = "report damaged: " + err.message + " \u00b7 ";
+        start(total);
+    });
+}
+function start(total) {
     const dataMs = performance.now();
     const title = document.title || "tavlolog report";
     $("title").textContent = title;
-    if (total !== N) $("warn").textContent = "report incomplete: " + fmtNum(N) + " of " + fmtNum(total) + " entries";
+    if (total !== N) $("warn").textContent += "report incomplete: " + fmtNum(N) + " of " + fmtNum(total) + " entries";
     const all = new Int32Array(N).map((_, i) => i);
-    const w = all.filter(e => !isRel(e)), r = all.filter(e => isRel(e));
+    const w = all.filter(e => !isRel(e) && !untimed(e)), r = all.filter(e => isRel(e));
     rangeOf(w, full.w); rangeOf(r, full.r);
     fullR = r.length > 0;
     view.w = full.w.slice(); view.r = full.r.slice();
@@ -681,14 +745,15 @@ function done(total) {
     drawCharts();  // now, not at the next frame: the first screen is complete when this returns
     document.body.dataset.ready = "1";
     // Where the load's time went, for the benchmark: page parsed up to the
-    // data, data loaded, of that the time in the decoder, first screen drawn
-    // (ms since navigation start).
+    // data, the whole page parsed, data inflated and decoded, of that the time
+    // in the decoder, first screen drawn (ms since navigation start).
     document.body.dataset.firstDataMs = Math.round(firstDataMs);
+    document.body.dataset.parsedMs = Math.round(parsedMs);
     document.body.dataset.dataMs = Math.round(dataMs);
     document.body.dataset.decodeMs = Math.round(decodeMs);
     document.body.dataset.firstDrawMs = Math.round(performance.now());
 }
 window.addEventListener("hashchange", () => { readFragment(); showControls(); refilter(true); });
-window.C = C;
+window.Z = Z;
 window.done = done;
 })();

@@ -44,17 +44,8 @@ void append_picture(std::string& out, uint8_t c) {
     out += static_cast<char>(0x80 | (cp & 0x3F));
 }
 
-// The one HTML or script escape of an ASCII character, null when it has none.
-const char* escape_of(uint8_t c, bool js) {
-    if (js) {
-        switch (c) {
-        case '<': return "\\x3c";  // no "</script" nor "<!--" in the script
-        case '"': return "\\\"";
-        case '\\': return "\\\\";
-        case '\t': return "\\t";
-        default: return nullptr;
-        }
-    }
+// The one HTML escape of an ASCII character, null when it has none.
+const char* html_escape_of(uint8_t c) {
     switch (c) {
     case '<': return "&lt;";
     case '>': return "&gt;";
@@ -65,7 +56,7 @@ const char* escape_of(uint8_t c, bool js) {
     }
 }
 
-void append_repaired(std::string& out, std::string_view text, bool js) {
+void append_repaired(std::string& out, std::string_view text, bool html) {
     out.reserve(out.size() + text.size());
     for (size_t i = 0; i < text.size();) {
         const size_t n = utf8_length(text, i);
@@ -76,7 +67,7 @@ void append_repaired(std::string& out, std::string_view text, bool js) {
         }
         const uint8_t c = static_cast<uint8_t>(text[i]);
         if (n == 1) {
-            const char* escaped = escape_of(c, js);
+            const char* escaped = html ? html_escape_of(c) : nullptr;
             if (escaped) {
                 out += escaped;
             } else if ((c < 0x20 && c != '\t') || c == 0x7F) {
@@ -84,10 +75,6 @@ void append_repaired(std::string& out, std::string_view text, bool js) {
             } else {
                 out += static_cast<char>(c);
             }
-        } else if (js && n == 3 && c == 0xE2 && text[i + 1] == '\x80' &&
-                   (text[i + 2] == '\xA8' || text[i + 2] == '\xA9')) {
-            // LINE and PARAGRAPH SEPARATOR end a line in older script engines.
-            out += text[i + 2] == '\xA8' ? "\\u2028" : "\\u2029";
         } else {
             out.append(text.data() + i, n);
         }
@@ -97,8 +84,8 @@ void append_repaired(std::string& out, std::string_view text, bool js) {
 
 }  // namespace
 
-void append_js_text(std::string& out, std::string_view text) { append_repaired(out, text, true); }
+void append_visible_text(std::string& out, std::string_view text) { append_repaired(out, text, false); }
 
-void append_html_text(std::string& out, std::string_view text) { append_repaired(out, text, false); }
+void append_html_text(std::string& out, std::string_view text) { append_repaired(out, text, true); }
 
 }  // namespace tavlolog
