@@ -11,8 +11,9 @@
 //     /dev/log/system until all are in main_log of a real run; the daemon's
 //     CPU (the main collector and the transist's threads) and the logger
 //     stand-in's, per 100,000 entries.
-// (f) resident memory of an Android collector process holding 10,000 entries
-//     at the overload, with typical and with the longest entries.
+// (f) resident memory of an Android collector process holding entries up to
+//     the overload (10,000 entries, or the byte budget), with typical and with
+//     the longest entries.
 // (g) wake-ups per second of a run's threads and collector processes with no
 //     log traffic.
 // Every line that reaches main_log is checked: each entry once, in order.
@@ -202,7 +203,7 @@ void stop_run(LogController* controller) {
 
 // (f) in a child of its own: the peak resident memory of an engine holding a
 // lone main entry and system entries up to the overload.
-void memory_at_overload(size_t message_len, long* base_kb, long* peak_kb) {
+void memory_at_overload(size_t message_len, long* base_kb, long* peak_kb, long* held) {
     int report[2];
     if (pipe(report) != 0) return;
     pid_t pid = fork();
@@ -212,7 +213,7 @@ void memory_at_overload(size_t message_len, long* base_kb, long* peak_kb) {
         cat.set_output_format();
         LogDevice* main_dev = cat.add_device("/dev/log/main", false, LOG_ID_MAIN, -1);
         LogDevice* system_dev = cat.add_device("/dev/log/system", false, LOG_ID_SYSTEM, -1);
-        long kb[2] = {status_kb("VmRSS:"), 0};
+        long kb[3] = {status_kb("VmRSS:"), 0, 0};
         std::string raw = legacy_entry(0, message_len);
         cat.take_entry(main_dev, raw.data(), raw.size());
         for (int i = 1; !cat.overloaded; i++) {
@@ -221,17 +222,19 @@ void memory_at_overload(size_t message_len, long* base_kb, long* peak_kb) {
             if (!cat.overloaded) cat.print_ready();
         }
         kb[1] = status_kb("VmRSS:");
+        kb[2] = cat.queued_count;
         cat.print_all();
         if (write(report[1], kb, sizeof(kb)) != sizeof(kb)) _exit(1);
         _exit(0);
     }
     close(report[1]);
-    long kb[2] = {-1, -1};
-    if (read(report[0], kb, sizeof(kb)) != sizeof(kb)) kb[0] = kb[1] = -1;
+    long kb[3] = {-1, -1, -1};
+    if (read(report[0], kb, sizeof(kb)) != sizeof(kb)) kb[0] = kb[1] = kb[2] = -1;
     close(report[0]);
     waitpid(pid, nullptr, 0);
     *base_kb = kb[0];
     *peak_kb = kb[1];
+    *held = kb[2];
 }
 
 double thread_cpu_s() {
@@ -438,9 +441,9 @@ int main(int argc, char** argv) {
            read_text("/proc/loadavg").c_str());
     fflush(stdout);  // forked children must not print this buffer again
 
-    long base_kb = 0, peak_kb = 0, long_base_kb = 0, long_peak_kb = 0;
-    memory_at_overload(0, &base_kb, &peak_kb);
-    memory_at_overload(LOGGER_MAX_PAYLOAD - 16, &long_base_kb, &long_peak_kb);
+    long base_kb = 0, peak_kb = 0, held = 0, long_base_kb = 0, long_peak_kb = 0, long_held = 0;
+    memory_at_overload(0, &base_kb, &peak_kb, &held);
+    memory_at_overload(LOGGER_MAX_PAYLOAD - 16, &long_base_kb, &long_peak_kb, &long_held);
     Engine d = engine_from_memory(n);
     EndToEnd e = end_to_end(n, logger);
     std::string detail;
@@ -457,9 +460,9 @@ int main(int argc, char** argv) {
            "writer %.2f s   %s\n",
            (e.collector_cpu + e.transist_cpu) * 1e5 / n, e.collector_cpu * 1e5 / n, e.transist_cpu * 1e5 / n,
            e.logger_cpu * 1e5 / n, e.writer_cpu * 1e5 / n, e.ok ? "content ok" : ("FAILED: " + e.why).c_str());
-    printf("(f) collector RSS at the overload: %.1f MB (%.1f MB before the entries; aim <= 8 MB); "
-           "with the longest entries %.1f MB\n",
-           peak_kb / 1024.0, base_kb / 1024.0, long_peak_kb / 1024.0);
+    printf("(f) collector RSS at the overload: %.1f MB holding %ld entries (%.1f MB before the entries); "
+           "with the longest entries %.1f MB holding %ld (aim <= 8 MB each)\n",
+           peak_kb / 1024.0, held, base_kb / 1024.0, long_peak_kb / 1024.0, long_held);
     printf("(g) idle run, wake-ups per second: %.2f (aim <= 2) over %d s:%s\n", wakeups, idle_s, detail.c_str());
     if (system("rm -rf /data/bench") != 0) return 1;
     return d.ok && e.ok ? 0 : 1;

@@ -90,7 +90,8 @@ int LogCat::set_output_format() {
 void LogCat::queue(LogDevice* device, QueuedEntry* entry) {
     enqueue_entry(device, entry);
     queued_count++;
-    if (queued_count > OVERLOAD_THRESHOLD) overloaded = true;
+    queued_bytes += queued_entry_size(entry);
+    if (queued_count > OVERLOAD_THRESHOLD || queued_bytes > OVERLOAD_BYTES) overloaded = true;
 }
 
 int LogCat::take_entry(LogDevice* device, const char* raw, size_t n) {
@@ -160,9 +161,10 @@ void LogCat::drop_next_entry(LogDevice* device) {
     print_start_marker(device);
     QueuedEntry* entry = dequeue_oldest(device);
     if (entry == nullptr) return;
+    queued_bytes -= queued_entry_size(entry);
     free_queued_entry(entry);
     queued_count--;
-    if (queued_count <= OVERLOAD_THRESHOLD) overloaded = false;
+    if (queued_count <= OVERLOAD_THRESHOLD && queued_bytes <= OVERLOAD_BYTES) overloaded = false;
 }
 
 void LogCat::print_next_entry(LogDevice* device) {

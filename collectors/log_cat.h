@@ -14,6 +14,9 @@
 // More queued entries than this and the collector is overloaded: it stops
 // holding entries back for ordering.
 constexpr int OVERLOAD_THRESHOLD = 9999;
+// The same when the held entries take more bytes than this: any app can write
+// entries of the longest payload, and 10,000 of those would take 40 MB.
+constexpr size_t OVERLOAD_BYTES = 4 << 20;
 
 class LogCat : public CollectorLink {
   public:
@@ -56,6 +59,7 @@ class LogCat : public CollectorLink {
     LogDevice* devices = nullptr;
     int device_count = 0;
     int queued_count = 0;
+    size_t queued_bytes = 0;  // blocks of the queued entries, headers included
     bool overloaded = false;
     EventTagMap* event_tag_map = nullptr;
 

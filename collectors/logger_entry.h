@@ -40,6 +40,11 @@ QueuedEntry* adapt_legacy_entry(const char* raw, size_t n, log_id_t log_id);
 
 void free_queued_entry(QueuedEntry* queued);
 
+// Bytes of the entry's block: what holding it costs.
+inline size_t queued_entry_size(const QueuedEntry* queued) {
+    return offsetof(QueuedEntry, entry) + sizeof(logger_entry) + queued->entry.len + 1;
+}
+
 // Writes the legacy bytes of a text entry (priority, tag, message) into out,
 // which has room for LOGGER_READ_MAX bytes; returns their count, or 0 when the
 // text does not fit.

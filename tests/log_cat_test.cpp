@@ -97,25 +97,33 @@ TEST(LogCatMerge, SendsInTimeOrderAndHoldsALoneEntryUntilItIsSafe) {
     }
 }
 
-// A lone main entry while system streams on: at 10,000 held entries a marker
-// releases it, the backlog drains in order, and the marker line follows later.
+// A lone main entry while system streams on: once more than 10,000 entries or
+// more than the byte budget are held, a marker releases it (not before), the
+// backlog drains in order, and the marker line follows later.
 TEST(LogCatMerge, OverloadReleasesTheHeldEntryWithAMarker) {
-    Engine engine("MS");
-    std::string raw = entry(1000, "first");
-    engine.cat.take_entry(engine.device(0), raw.data(), raw.size());
-    std::string expect = "^main first ^system ";
-    for (int i = 0; i < 10000; i++) {
-        raw = entry(2000 + i, "s" + std::to_string(i));
-        engine.cat.take_entry(engine.device(1), raw.data(), raw.size());
-        engine.cat.print_ready();
-        engine.cat.flush_output();
-        if (i < 9999) expect += "s" + std::to_string(i) + " ";
-        EXPECT_TRUE(i > 9997 || engine.sent().empty()) << "released before the overload";
+    for (size_t pad : {0, 4000}) {
+        Engine engine("MS");
+        std::string raw = entry(1000, "first");
+        engine.cat.take_entry(engine.device(0), raw.data(), raw.size());
+        std::string expect = "^main first ^system ";
+        int i = 0;
+        for (; engine.sent().empty(); i++) {
+            ASSERT_LT(i, 10000) << "never released, pad " << pad;
+            std::string message = "s" + std::to_string(i) + std::string(pad, 'x');
+            raw = entry(2000 + i, message);
+            engine.cat.take_entry(engine.device(1), raw.data(), raw.size());
+            bool over = engine.cat.queued_count > 9999 || engine.cat.queued_bytes > OVERLOAD_BYTES;
+            engine.cat.print_ready();
+            engine.cat.flush_output();
+            ASSERT_EQ(engine.sent().empty(), !over) << "entry " << i << ", pad " << pad;
+            if (!over) expect += message + " ";
+        }
+        EXPECT_EQ(i == 9999, pad == 0) << "released after " << i << " entries, pad " << pad;
+        EXPECT_EQ(tokens(engine.sent()), expect);
+        engine.cat.print_all();
+        EXPECT_NE(lines_of(kOut).back().find("    0     0 W ORU     : trigger log"), std::string::npos)
+            << lines_of(kOut).back();
     }
-    EXPECT_EQ(tokens(engine.sent()), expect);
-    engine.cat.print_all();
-    EXPECT_NE(lines_of(kOut).back().find("    0     0 W ORU     : trigger log"), std::string::npos)
-        << lines_of(kOut).back();
 }
 
 // The loop on two datagram socket pairs: whatever made it end, everything it
