@@ -60,7 +60,10 @@ static void queue_chunk(int type, const char* data, int n) {
     pthread_mutex_lock(&queue_lock);
     int rc = queue_append(fill_queue, type, data, n, transist_capacity);
     int err = errno;
+    bool writer_was_idle = writer_idle;
+    writer_idle = false;
     pthread_mutex_unlock(&queue_lock);
+    if (writer_was_idle) wake_idle_writer();
     if (rc == 1) {
         malloc_failure_recorded = false;
     } else if (!malloc_failure_recorded) {
@@ -380,16 +383,21 @@ void* read_thread(void*) {
         return reinterpret_cast<void*>(1);
     }
 
+    int flush_ms = -1;
     while (!stop_requested) {
         bool paused = queue_full();
         PollSet set;
         build_poll_set(&set, !paused, true);
-        int timeout_ms = 1000;
+        // Only a connection that has not named its type yet and a summary of
+        // refused clients held back need a clock; otherwise the reader sleeps
+        // until a connection, data or the wake counter (stop, resume).
+        int timeout_ms = flush_ms;
         int64_t now = monotonic_us();
         for (const PendingConn& conn : pending) {
             if (conn.fd < 0 || conn.type >= 0) continue;
             int64_t left = (conn.expires - now) / 1000 + 1;
-            if (left < timeout_ms) timeout_ms = left > 0 ? static_cast<int>(left) : 0;
+            if (left < 0) left = 0;
+            if (timeout_ms < 0 || left < timeout_ms) timeout_ms = static_cast<int>(left);
         }
         int n = poll(set.fds, static_cast<nfds_t>(set.count), timeout_ms);
         if (n < 0) {
@@ -406,7 +414,7 @@ void* read_thread(void*) {
             handle_ready(&set, 1);
         }
         expire_pending(monotonic_us());
-        peer_records_flush();
+        flush_ms = peer_records_flush();
     }
 
     drain_at_stop();
