@@ -19,6 +19,7 @@
 #include "common/io_util.h"
 #include "common/limits.h"
 #include "common/wlog.h"
+#include "platform/properties.h"
 #include "storage/history_log.h"
 
 const char* LogCat::device_root = "/dev/log/";
@@ -94,7 +95,38 @@ void LogCat::queue(LogDevice* device, QueuedEntry* entry) {
     if (queued_count > OVERLOAD_THRESHOLD || queued_bytes > OVERLOAD_BYTES) overloaded = true;
 }
 
+static int64_t monotonic_now_us() {
+    struct timespec ts;
+    clock_gettime(CLOCK_MONOTONIC, &ts);
+    return static_cast<int64_t>(ts.tv_sec) * 1000000 + ts.tv_nsec / 1000;
+}
+
+// The writer and tag of legacy entry bytes, for the flood budget: a text
+// entry's tag follows its priority byte; an event's is its number.
+static bool entry_writer(const LogDevice* device, const char* raw, size_t n, int32_t* pid, char* tag) {
+    if (n < LEGACY_HEADER_SIZE + 4) return false;
+    uint32_t value;
+    memcpy(&value, raw + 4, sizeof(value));  // little-endian, as the device
+    *pid = static_cast<int32_t>(value);
+    if (device->binary) {
+        memcpy(&value, raw + LEGACY_HEADER_SIZE, sizeof(value));
+        snprintf(tag, FLOOD_TAG_LEN, "%u", value);
+        return true;
+    }
+    const char* text = raw + LEGACY_HEADER_SIZE + 1;
+    size_t len = strnlen(text, n - LEGACY_HEADER_SIZE - 1);
+    if (len >= FLOOD_TAG_LEN) len = FLOOD_TAG_LEN - 1;
+    memcpy(tag, text, len);
+    tag[len] = '\0';
+    return true;
+}
+
 int LogCat::take_entry(LogDevice* device, const char* raw, size_t n) {
+    if (flood.budget() != 0) {
+        int32_t pid;
+        char tag[FLOOD_TAG_LEN];
+        if (entry_writer(device, raw, n, &pid, tag) && !flood.admit(pid, tag, n, monotonic_now_us())) return 0;
+    }
     QueuedEntry* entry = adapt_legacy_entry(raw, n, device->log_id);
     if (entry == nullptr) {
         // Once per process: a device that keeps handing out such bytes must
@@ -203,6 +235,29 @@ void LogCat::print_next_entry(LogDevice* device) {
     drop_next_entry(device);
 }
 
+void LogCat::report_drops(bool all) {
+    if (flood.budget() == 0) return;
+    FloodDrops drops;
+    int64_t now_us = monotonic_now_us();
+    while (all ? flood.next_summary_now(&drops) : flood.next_summary(now_us, &drops)) {
+        char message[192];
+        snprintf(message, sizeof(message),
+                 "dropped %ld entries (%ld bytes) of pid %d tag %s: past its budget of %ld KB/s", drops.entries,
+                 drops.bytes, static_cast<int>(drops.pid), drops.tag, flood.budget() / 1024);
+        struct timeval now;
+        gettimeofday(&now, nullptr);
+        AndroidLogEntry line = {};
+        line.tv_sec = now.tv_sec;
+        line.tv_nsec = now.tv_usec * 1000L;
+        line.priority = ANDROID_LOG_WARN;
+        line.tag = "TavloLogD";
+        line.tagLen = strlen(line.tag);
+        line.message = message;
+        line.messageLen = strlen(message);
+        format_and_send(line);
+    }
+}
+
 void LogCat::push_marker_entry(LogDevice* device) {
     struct timeval now;
     gettimeofday(&now, nullptr);
@@ -235,6 +290,8 @@ void LogCat::print_all() {
 
 void LogCat::finish(int status, int reason) {
     print_all();
+    report_drops(true);
+    flush_output();
     exit_collector(this, status, reason);
 }
 
@@ -291,14 +348,20 @@ void LogCat::read_log_lines() {
             // remainder a timed-out select leaves, later waits would return
             // at once and the collector would spin.
             struct timespec batch = {0, BATCH_NS};
-            ready = pselect(maxfd + 1, &readable, nullptr, nullptr, wait_forever ? nullptr : &batch,
-                            &wait_mask);
+            // Drops of a flood are told once a second, also when the flood
+            // has stopped: the only clock this loop keeps while nothing flows.
+            int due_ms = flood.budget() != 0 ? flood.summary_due_ms(monotonic_now_us()) : -1;
+            struct timespec summary = {due_ms / 1000, (due_ms % 1000) * 1000000L};
+            struct timespec* wait = wait_forever ? (due_ms >= 0 ? &summary : nullptr) : &batch;
+            ready = pselect(maxfd + 1, &readable, nullptr, nullptr, wait, &wait_mask);
         } while (ready < 0 && errno == EINTR && !stop_signalled);
         if (ready < 0) continue;
 
         if (ready == 0) {
             // Quiet for the batching time: nothing older can still come.
             print_all();
+            report_drops(false);
+            flush_output();
             wait_forever = true;
             continue;
         }
@@ -308,6 +371,7 @@ void LogCat::read_log_lines() {
         }
         if (interrupted) continue;
         print_ready();
+        report_drops(false);
         wait_forever = false;
     }
 }
@@ -323,6 +387,13 @@ void LogCat::run(const char*, const char* device, int block_fd) {
     }
     WLOG(TAG_ANDROID, WLOG_DEBUG, "map Shared memory ok!");
     format = android_log_format_new();
+    char budget[PROPERTY_VALUE_MAX];
+    property_get(PROP_PID_BUDGET, budget, "0");
+    long kb = atol(budget);
+    if (kb > 0 && kb <= FLOOD_BUDGET_MAX_KB) {
+        flood.set_budget(kb * 1024);
+        WLOG(TAG_ANDROID, WLOG_INFO, "entries past %ld KB/s of one pid are dropped", kb);
+    }
 
     char path[PATH_LEN];
     if (device != nullptr) {

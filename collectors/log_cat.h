@@ -9,6 +9,7 @@
 #include <log/logprint.h>
 
 #include "collectors/collector_link.h"
+#include "collectors/flood_guard.h"
 #include "collectors/log_device.h"
 
 // More queued entries than this and the collector is overloaded: it stops
@@ -42,8 +43,12 @@ class LogCat : public CollectorLink {
     // Selects "threadtime"; 0 when the library does not know it.
     int set_output_format();
     // Queues one entry's bytes as read from device. Returns 1, or 0 when they
-    // were not a whole entry (dropped) or memory is short.
+    // were not a whole entry (dropped), memory is short, or the writer is past
+    // its budget (flood; counted there).
     int take_entry(LogDevice* device, const char* raw, size_t n);
+    // Sends the summary lines of the flood drops that are due (all of them
+    // when `all`), each a "threadtime" line of the collector's own.
+    void report_drops(bool all);
     // After a pass that read data: sends what is safe to send, holding back
     // an entry that is alone in its device's queue (an older one of another
     // device may still be unread) unless the collector is overloaded.
@@ -62,6 +67,7 @@ class LogCat : public CollectorLink {
     size_t queued_bytes = 0;  // blocks of the queued entries, headers included
     bool overloaded = false;
     EventTagMap* event_tag_map = nullptr;
+    FloodGuard flood;  // off unless PROP_PID_BUDGET is set
 
   private:
     void print_next_entry(LogDevice* device);

@@ -15,6 +15,7 @@
 #include <stdlib.h>
 #include <string.h>
 
+#include "collectors/flood_guard.h"
 #include "common/control_client.h"
 #include "common/control_protocol.h"
 #include "core/log_controller.h"
@@ -129,6 +130,15 @@ static int run_status() {
         printf("rotation size: %s KB\n", logsize);
     } else {
         printf("rotation size: unknown\n");
+    }
+    // Read by each Android collector as a run starts.
+    char budget[PROPERTY_VALUE_MAX];
+    property_get(PROP_PID_BUDGET, budget, "0");
+    long kb = atol(budget);
+    if (kb > 0 && kb <= FLOOD_BUDGET_MAX_KB) {
+        printf("per-pid budget (%s): %ld KB/s, entries past it dropped and summarised\n", PROP_PID_BUDGET, kb);
+    } else {
+        printf("per-pid budget (%s): off, every entry kept\n", PROP_PID_BUDGET);
     }
     return EXIT_DONE;
 }
