@@ -178,15 +178,23 @@ void LogCat::print_start_marker(LogDevice* device) {
 }
 
 void LogCat::format_and_send(const AndroidLogEntry& line) {
-    char buf[512];
+    // Rendered straight into the batch when it fits in 512 bytes, as nearly
+    // every line does: one copy less per line.
+    const size_t room = 512;
+    if (sizeof(output) - output_len < room) flush_output();
+    char* buf = output + output_len;
     size_t len = 0;
-    char* text = android_log_formatLogLine(format, buf, sizeof(buf), &line, &len);
+    char* text = android_log_formatLogLine(format, buf, room, &line, &len);
     if (text == nullptr) {
         HLOG(TAG_ANDROID, WLOG_ERROR, "output error");
         exit_collector(this, 1, REASON_OUTPUT);
     }
+    if (text == buf) {
+        output_len += len;
+        return;
+    }
     append_output(text, len);
-    if (text != buf) free(text);
+    free(text);
 }
 
 void LogCat::drop_next_entry(LogDevice* device) {

@@ -55,7 +55,7 @@ class LogCat : public CollectorLink {
     void print_ready();
     // Sends everything queued, oldest first, and every rendered line.
     void print_all();
-    // Lines go out in batches of up to 4 KB, one send each: a stream costs a
+    // Lines go out in batches of up to 16 KB, one send each: a stream costs a
     // send per batch rather than per line. Sends the batch so far.
     void flush_output();
     // The reading loop over the open devices; never returns.
@@ -88,6 +88,6 @@ class LogCat : public CollectorLink {
     AndroidLogFormat* format = nullptr;
     char event_text[1024];  // decoded binary values
     char event_tag[64];     // an event's tag name from the tag map
-    char output[4096];      // rendered lines not sent yet
+    char output[16384];     // rendered lines not sent yet
     size_t output_len = 0;
 };

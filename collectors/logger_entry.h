@@ -40,6 +40,14 @@ QueuedEntry* adapt_legacy_entry(const char* raw, size_t n, log_id_t log_id);
 
 void free_queued_entry(QueuedEntry* queued);
 
+// Entries of up to this many bytes (queued_entry_size; nearly all of them)
+// take a block of this size from a pool of freed blocks instead of the
+// allocator: most entries live a few milliseconds, and the pool is bounded
+// by the most that are held at once (the overload's count), so it is
+// allocated once, not per entry.
+constexpr size_t ENTRY_BLOCK_SIZE = 256;
+constexpr int ENTRY_POOL_MAX = 10000;
+
 // Bytes of the entry's block: what holding it costs.
 inline size_t queued_entry_size(const QueuedEntry* queued) {
     return offsetof(QueuedEntry, entry) + sizeof(logger_entry) + queued->entry.len + 1;
