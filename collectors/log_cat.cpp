@@ -370,6 +370,7 @@ void LogCat::read_log_lines() {
             print_all();
             report_drops(false);
             flush_output();
+            trim_entry_pool(ENTRY_POOL_QUIET);
             wait_forever = true;
             continue;
         }

@@ -37,6 +37,15 @@ static QueuedEntry* take_block() {
     return block;
 }
 
+void trim_entry_pool(int keep) {
+    while (pool_count > keep) {
+        QueuedEntry* block = pool;
+        pool = block->next;
+        pool_count--;
+        free(block);
+    }
+}
+
 QueuedEntry* adapt_legacy_entry(const char* raw, size_t n, log_id_t log_id) {
     if (n < LEGACY_HEADER_SIZE) return nullptr;
     size_t len = le16(raw);

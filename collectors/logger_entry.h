@@ -47,6 +47,12 @@ void free_queued_entry(QueuedEntry* queued);
 // allocated once, not per entry.
 constexpr size_t ENTRY_BLOCK_SIZE = 256;
 constexpr int ENTRY_POOL_MAX = 10000;
+// Once the collector is quiet, the pool keeps this many blocks: a burst's
+// memory goes back.
+constexpr int ENTRY_POOL_QUIET = 256;
+
+// Frees pooled blocks beyond keep.
+void trim_entry_pool(int keep);
 
 // Bytes of the entry's block: what holding it costs.
 inline size_t queued_entry_size(const QueuedEntry* queued) {
