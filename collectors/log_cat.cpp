@@ -28,6 +28,8 @@ const char* LogCat::device_root = "/dev/log/";
 // merged before they go out.
 constexpr long BATCH_NS = 5 * 1000 * 1000;
 constexpr int PRIORITY_WARN = 5;
+constexpr int READS_PER_PASS = 64;
+constexpr int SINGLE_READ_PASSES = 8;
 
 // One read buffer for the process: a read hands over one whole entry, which
 // is then copied into a block of its own size.
@@ -341,7 +343,14 @@ void LogCat::read_log_lines() {
     defer_stop_signal = true;
 
     int maxfd = -1;
-    for (LogDevice* d = devices; d != nullptr; d = d->next) maxfd = d->fd > maxfd ? d->fd : maxfd;
+    for (LogDevice* d = devices; d != nullptr; d = d->next) {
+        maxfd = d->fd > maxfd ? d->fd : maxfd;
+        // A device with a backlog is read until it has nothing more, up to
+        // READS_PER_PASS entries: a wait per entry would cost a busy log (or
+        // a flood) more than reading it. One that had none is read an entry
+        // a pass for a while: the read finding nothing would cost as much.
+        fcntl(d->fd, F_SETFL, fcntl(d->fd, F_GETFL) | O_NONBLOCK);
+    }
     bool wait_forever = false;
     for (;;) {
         if (stop_signalled) finish_at_stop(REASON_SIGNAL);
@@ -376,7 +385,12 @@ void LogCat::read_log_lines() {
         }
         bool interrupted = false;
         for (LogDevice* d = devices; d != nullptr && !interrupted; d = d->next) {
-            if (FD_ISSET(d->fd, &readable) && read_entry(d, &interrupted) == 0) break;
+            if (!FD_ISSET(d->fd, &readable)) continue;
+            int max_reads = d->single_reads > 0 ? 1 : READS_PER_PASS;
+            if (d->single_reads > 0) d->single_reads--;
+            int reads = 0;
+            while (reads < max_reads && read_entry(d, &interrupted) == 1) reads++;
+            if (max_reads > 1 && reads < 2 && !interrupted) d->single_reads = SINGLE_READ_PASSES;
         }
         if (interrupted) continue;
         print_ready();

@@ -45,7 +45,7 @@ void free_queued_entry(QueuedEntry* queued);
 // allocator: most entries live a few milliseconds, and the pool is bounded
 // by the most that are held at once (the overload's count), so it is
 // allocated once, not per entry.
-constexpr size_t ENTRY_BLOCK_SIZE = 256;
+constexpr size_t ENTRY_BLOCK_SIZE = 192;
 constexpr int ENTRY_POOL_MAX = 10000;
 // Once the collector is quiet, the pool keeps this many blocks: a burst's
 // memory goes back.
