@@ -126,13 +126,17 @@ void BtCat::forward() {
             ready = pselect(mSockListenId + 1, &readable, nullptr, nullptr,
                             wait_forever ? nullptr : &quiet, &wait_mask);
         } while (ready < 0 && errno == EINTR && !stop_signalled);
-        if (ready < 0) continue;
+        if (ready < 0) {
+            if (errno != EINTR) back_off_after_failed_wait(this, errno, &wait_mask);
+            continue;
+        }
 
         if (ready > 0 && FD_ISSET(mSockListenId, &readable)) {
             ssize_t n = read(mSockListenId, buf, BT_CHUNK);
             if (n < 0) {
                 int err = errno;
-                if (err == EINTR || err == EAGAIN) return;
+                // Nothing was taken: read again once the wait says so.
+                if (err == EINTR || err == EAGAIN) continue;
                 HLOG(TAG_BT, WLOG_ERROR, "btcat read, errno = %d, %s", err, strerror(err));
                 pause_a_while();
                 exit_collector(this, 0, REASON_READ);

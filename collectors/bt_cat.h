@@ -12,9 +12,12 @@ class BtCat : public CollectorLink {
     BtCat() : CollectorLink(KIND_BT, 'B') {}
     ~BtCat() override {}
 
-    // Runs in the collector child. Returns after a failed send or an
-    // interrupted read; every other ending goes through exit_collector.
+    // Runs in the collector child. Returns after a failed send; every other
+    // ending goes through exit_collector.
     void run(const char* name, int shm_fd);
+    // The forwarding loop over mSockListenId; tests run it on a descriptor
+    // of their own.
+    void forward();
 
     int mSockListenId = 0;  // connection to "btlog", 0 until connected
 
@@ -24,7 +27,6 @@ class BtCat : public CollectorLink {
 
   private:
     void connect_service();
-    void forward();
     // Sends what the service has sent so far, then ends (asked to stop).
     [[noreturn]] void finish_at_stop(int reason);
 };

@@ -7,6 +7,7 @@
 #include <stdlib.h>
 #include <string.h>
 #include <sys/mman.h>
+#include <sys/select.h>
 #include <sys/socket.h>
 #include <time.h>
 #include <unistd.h>
@@ -24,6 +25,7 @@ CollectorLink* volatile current_collector = nullptr;
 volatile sig_atomic_t stop_signalled = 0;
 pid_t collector_daemon_pid = 0;
 unsigned int connect_retry_us = 1000000;
+unsigned int failed_wait_pause_us = 1000000;
 
 constexpr int CONNECT_ATTEMPTS = 5;
 // The holders keep the semaphore for a few instructions; far longer means the
@@ -237,6 +239,18 @@ void on_stop_signal(int) {
         return;
     }
     exit_collector(collector, 0, REASON_SIGNAL);
+}
+
+void back_off_after_failed_wait(CollectorLink* collector, int err, const sigset_t* wait_mask) {
+    static bool recorded = false;
+    if (!recorded) {
+        recorded = true;
+        COLLECTOR_HLOG(collector->kind, WLOG_ERROR, "%c: select failed: %s(%d)", collector->log_type,
+                       strerror(err), err);
+    }
+    struct timespec pause = {static_cast<time_t>(failed_wait_pause_us / 1000000),
+                             static_cast<long>(failed_wait_pause_us % 1000000) * 1000};
+    pselect(0, nullptr, nullptr, nullptr, &pause, wait_mask);
 }
 
 void hold_stop_signal(sigset_t* wait_mask) {

@@ -45,6 +45,8 @@ extern pid_t collector_daemon_pid;
 
 // Pause between connection attempts; 1 s on the phone, shortened by tests.
 extern unsigned int connect_retry_us;
+// Pause after a failed wait; 1 s on the phone, shortened by tests.
+extern unsigned int failed_wait_pause_us;
 
 // Sets current_collector and installs on_stop_signal for SIGUSR1. Returns 0,
 // or -1 (errno set) when the handler cannot be installed.
@@ -74,6 +76,12 @@ void check_stop(CollectorLink* collector);
 
 // SIGUSR1: end with status 0 and REASON_SIGNAL (or, deferred, only note it).
 void on_stop_signal(int sig);
+
+// After a wait (select) failed with err, not EINTR: such a failure comes back
+// at once, so rather than spin the collector records it (once per process)
+// and pauses (failed_wait_pause_us) before it waits again, as the daemon's
+// control loop does. The pause takes the stop signal as the wait does.
+void back_off_after_failed_wait(CollectorLink* collector, int err, const sigset_t* wait_mask);
 
 // Keeps SIGUSR1 blocked from now on and stores in wait_mask the mask to wait
 // with (pselect), so the stop signal is only taken while the collector is

@@ -92,7 +92,10 @@ void KmsgCat::forward(int kmsg_fd) {
             ready = pselect(kmsg_fd + 1, &readable, nullptr, nullptr,
                             wait_forever ? nullptr : &quiet, &wait_mask);
         } while (ready < 0 && errno == EINTR);
-        if (ready < 0) continue;
+        if (ready < 0) {
+            back_off_after_failed_wait(this, errno, &wait_mask);
+            continue;
+        }
 
         if (ready > 0 && FD_ISSET(kmsg_fd, &readable)) {
             size_t n = read_ready(kmsg_fd, buf);

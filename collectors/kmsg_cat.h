@@ -16,7 +16,7 @@ class KmsgCat : public CollectorLink {
     // The kernel log source; tests point it at a FIFO.
     static const char* kmsg_path;
 
-  private:
-    // The forwarding loop over the open source descriptor.
+    // The forwarding loop over the open source descriptor; tests run it on a
+    // descriptor of their own.
     void forward(int kmsg_fd);
 };

@@ -188,6 +188,9 @@ void LogCat::format_and_send(const AndroidLogEntry& line) {
     size_t len = 0;
     char* text = android_log_formatLogLine(format, buf, room, &line, &len);
     if (text == nullptr) {
+        // The lines rendered before this one are whole: they still go out
+        // (a failed send records "output error" and ends there).
+        flush_output();
         HLOG(TAG_ANDROID, WLOG_ERROR, "output error");
         exit_collector(this, 1, REASON_OUTPUT);
     }
@@ -206,7 +209,10 @@ void LogCat::drop_next_entry(LogDevice* device) {
     queued_bytes -= queued_entry_size(entry);
     free_queued_entry(entry);
     queued_count--;
-    if (queued_count <= OVERLOAD_THRESHOLD && queued_bytes <= OVERLOAD_BYTES) overloaded = false;
+    if (queued_count <= OVERLOAD_THRESHOLD && queued_bytes <= OVERLOAD_BYTES) {
+        overloaded = false;
+        marker_queued = false;
+    }
 }
 
 void LogCat::print_next_entry(LogDevice* device) {
@@ -284,8 +290,14 @@ void LogCat::print_ready() {
         if (first == nullptr) break;
         if (holds_single_entry(first)) {
             if (!overloaded) break;
-            // Too much held back: a marker behind the lone entry releases it.
-            push_marker_entry(first);
+            // Too much held back: the lone entry goes out, with one marker per
+            // overload to say so. The marker is dated now; when the clock has
+            // stepped back behind the entries it sorts first and goes out
+            // first, and the lone entry follows in the next turn all the same.
+            if (!marker_queued) {
+                push_marker_entry(first);
+                marker_queued = true;
+            }
         }
         print_next_entry(first);
     }
@@ -372,7 +384,10 @@ void LogCat::read_log_lines() {
             struct timespec* wait = wait_forever ? (due_ms >= 0 ? &summary : nullptr) : &batch;
             ready = pselect(maxfd + 1, &readable, nullptr, nullptr, wait, &wait_mask);
         } while (ready < 0 && errno == EINTR && !stop_signalled);
-        if (ready < 0) continue;
+        if (ready < 0) {
+            if (errno != EINTR) back_off_after_failed_wait(this, errno, &wait_mask);
+            continue;
+        }
 
         if (ready == 0) {
             // Quiet for the batching time: nothing older can still come.

@@ -90,4 +90,5 @@ class LogCat : public CollectorLink {
     char event_tag[64];     // an event's tag name from the tag map
     char output[16384];     // rendered lines not sent yet
     size_t output_len = 0;
+    bool marker_queued = false;  // this overload's marker is queued (or sent)
 };

@@ -167,12 +167,13 @@ int config_read_system_defaults(ConfigCache* cache) {
 }
 
 int config_load(ConfigCache* cache) {
+    int rc = 0;
     if (config_read_file(cache, CONFIG_FILE) == 0) {
         HLOG(TAG_CONFIG, WLOG_ERROR, "some thing wrong when read %s,recreate a new one", CONFIG_FILE);
-        config_write(cache);
+        if (config_write(cache) < 0) rc = -1;
     }
     apply_log_path_override(cache);
-    return 0;
+    return rc;
 }
 
 int config_write(const ConfigCache* cache) {
@@ -229,12 +230,14 @@ int config_update_item(ConfigCache* cache, const char* key, const char* value) {
     return 1;
 }
 
-void config_change(ConfigCache* cache, const char* key, const char* value) {
-    config_load(cache);
+int config_change(ConfigCache* cache, const char* key, const char* value) {
+    // Without a file the cache holds defaults: an "unchanged" value is not stored.
+    bool stored = config_load(cache) == 0;
     if (config_update_item(cache, key, value) == 1) {
         WLOG(TAG_CONFIG, WLOG_DEBUG, "change config,key:%s,value:%s", key, value);
-        config_write(cache);
+        stored = config_write(cache) >= 0;
     }
+    return stored ? 1 : 0;
 }
 
 const char* config_get(ConfigCache* cache, const char* key) {

@@ -26,10 +26,14 @@ void config_make_dir();
 void config_set_defaults(ConfigCache* cache);
 int config_read_file(ConfigCache* cache, const char* path);
 int config_read_system_defaults(ConfigCache* cache);
+// Returns 0, or -1 when the file could be neither read nor made anew.
 int config_load(ConfigCache* cache);
 int config_write(const ConfigCache* cache);
 int config_update_item(ConfigCache* cache, const char* key, const char* value);
-void config_change(ConfigCache* cache, const char* key, const char* value);
+// Returns 1 when the file holds the item's value afterwards (also when it was
+// already that value or the key is unknown), 0 when the file could not be
+// read or written.
+int config_change(ConfigCache* cache, const char* key, const char* value);
 const char* config_get(ConfigCache* cache, const char* key);
 void config_parse_line(ConfigCache* cache, const char* line);
 void config_map_system_key(ConfigCache* cache, const char* key, const char* value);

@@ -109,7 +109,9 @@ void copy_saved_logs(LogController* controller) {
         const char* folder;
         const char* name;
         const char* suffix;
-    } held[] = {{TEMP_FOLDER, "log_temp", ".boot"}, {HBR_FOLDER, "log_hbr", ".hbr"}};
+    } held[] = {{PREV_BOOT_FOLDER, "log_temp_prev", ".prev_boot"},
+                {TEMP_FOLDER, "log_temp", ".boot"},
+                {HBR_FOLDER, "log_hbr", ".hbr"}};
     for (const auto& h : held) {
         if (!exists(h.folder)) continue;
         CopyResult rc = copy_log_folder(controller, h.folder, controller->run_folder, h.suffix);
@@ -136,7 +138,12 @@ int boot_fail_copy(LogController* controller) {
         HLOG(TAG_MAIN, WLOG_ERROR, "create %s failed", folder);
         return -1;
     }
-    CopyResult rc = copy_log_folder(controller, TEMP_FOLDER, controller->run_folder, ".boot");
+    CopyResult rc = COPY_DONE;
+    if (exists(PREV_BOOT_FOLDER)) {
+        rc = copy_log_folder(controller, PREV_BOOT_FOLDER, controller->run_folder, ".prev_boot");
+        remove_if_empty("/data/", "log_temp_prev");
+    }
+    if (rc != COPY_ABORT) rc = copy_log_folder(controller, TEMP_FOLDER, controller->run_folder, ".boot");
     WLOG(TAG_MAIN, WLOG_DEBUG, "Delete '%s'.", TEMP_FOLDER);
     remove_if_empty("/data/", "log_temp");
     // A card that failed during the copy is no complete copy.

@@ -5,13 +5,16 @@
 class LogController;
 
 #define TEMP_FOLDER "/data/log_temp/"
+// What the boot before held in TEMP_FOLDER and never copied, kept for the next copy.
+#define PREV_BOOT_FOLDER "/data/log_temp_prev/"
 #define HBR_FOLDER "/data/log_hbr/"
 #define OTHER_MODE_FOLDER "/data/log_other_mode/"
 
 // Copies every holding folder into the controller's run folder.
 void copy_saved_logs(LogController* controller);
-// Stops the run and copies /data/log_temp/ into a new BOOTFAIL_ folder: 0, or
-// -1 when the folder could not be made or the card failed during the copy.
+// Stops the run and copies what the boot before held, then /data/log_temp/,
+// into a new BOOTFAIL_ folder: 0, or -1 when the folder could not be made or
+// the card failed during the copy.
 int boot_fail_copy(LogController* controller);
 // Waits up to 30 s for the log path to become a link to the card, then moves
 // the run there and copies what it held; stops the run when no card came.

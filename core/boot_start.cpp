@@ -3,7 +3,9 @@
 #include "core/boot_start.h"
 
 #include <errno.h>
+#include <fcntl.h>
 #include <stdio.h>
+#include <stdlib.h>
 #include <string.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -28,10 +30,79 @@ namespace {
 constexpr int BOOT_RUN_MB = 60;
 constexpr int OTHER_BOOT_RUN_MB = BOOT_RUN_MB / 3;
 constexpr char KELM_LOG_PATH[] = "/data/ext_sdcard_tool";
+// The room a boot's holding folder needs on /data: its whole run, and the
+// reserve below which /data counts as low and the run stops.
+constexpr uint64_t HOLDING_ROOM_BYTES = (static_cast<uint64_t>(BOOT_RUN_MB) << 20) + LOW_STORAGE_BYTES;
 
 bool exists(const char* path) {
     struct stat st;
     return lstat(path, &st) == 0;
+}
+
+// Set by the first daemon of a boot once its folder is made; gone at reboot.
+bool restarted_in_this_boot() {
+    char booted[PROPERTY_VALUE_MAX];
+    property_get(PROP_BOOTED, booted, "0");
+    return strcmp(booted, "1") == 0;
+}
+
+// A file or a link where a holding folder of /data belongs would keep every
+// later boot from recording: it goes, a link itself, never what it points to.
+void remove_stray(const char* name) {
+    UniqueFd data(safe_open_dir("/data", "/data", false, 0));
+    struct stat st;
+    if (!data.ok() || fstatat(data.get(), name, &st, AT_SYMLINK_NOFOLLOW) != 0 || S_ISDIR(st.st_mode)) return;
+    HLOG(TAG_MAIN, WLOG_ERROR, "/data/%s is not a folder, will delete it", name);
+    if (safe_remove_file(data.get(), name) != 0) {
+        int err = errno;
+        HLOG(TAG_MAIN, WLOG_ERROR, "rm /data/%s failed(%s)", name, strerror(err));
+    }
+}
+
+void remove_held(int data, const char* name) {
+    if (safe_remove_tree(data, name) != 0 && errno != ENOENT) {
+        int err = errno;
+        HLOG(TAG_MAIN, WLOG_ERROR, "rm -r /data/%s failed(%s)", name, strerror(err));
+    }
+}
+
+int note_log(void* found, const char* name, int) {
+    if (name[0] == '.') return 0;  // never copied
+    *static_cast<bool*>(found) = true;
+    return 1;
+}
+
+// The first daemon of a boot finds in /data/log_temp what the boot before
+// held. Still there, it was never copied: that boot ended before any client or
+// the boot-copy wait came (a boot loop, an early crash), and those are the logs
+// wanted most. They are kept aside for the next copy: the one boot before
+// only, and only while this boot's holding folder keeps its room.
+void keep_previous_boot() {
+    UniqueFd data(safe_open_dir("/data", "/data", false, 0));
+    struct stat st;
+    if (!data.ok()) return;
+    if (fstatat(data.get(), "log_temp_prev", &st, AT_SYMLINK_NOFOLLOW) == 0) {
+        HLOG(TAG_MAIN, WLOG_WARN, "held logs of an earlier boot in %s dropped", PREV_BOOT_FOLDER);
+        remove_held(data.get(), "log_temp_prev");
+    }
+    if (fstatat(data.get(), "log_temp", &st, AT_SYMLINK_NOFOLLOW) != 0) return;
+    bool found = false;
+    UniqueFd held(safe_open_dir("/data", TEMP_FOLDER, false, 0));
+    if (held.ok()) safe_list_dir(held.get(), note_log, &found);
+    if (found) {
+        uint64_t free_bytes = get_free_space("/data", 0);
+        if (free_bytes < HOLDING_ROOM_BYTES) {
+            HLOG(TAG_MAIN, WLOG_WARN, "held logs of the previous boot dropped, /data has %lluMB free",
+                 static_cast<unsigned long long>(free_bytes >> 20));
+        } else if (renameat(data.get(), "log_temp", data.get(), "log_temp_prev") == 0) {
+            HLOG(TAG_MAIN, WLOG_INFO, "held logs of the previous boot kept in %s", PREV_BOOT_FOLDER);
+            return;
+        } else {
+            int err = errno;
+            HLOG(TAG_MAIN, WLOG_ERROR, "mv %s %s failed(%s)", TEMP_FOLDER, PREV_BOOT_FOLDER, strerror(err));
+        }
+    }
+    remove_held(data.get(), "log_temp");
 }
 
 // The first boot seeds the configuration from the system image's defaults.
@@ -102,6 +173,9 @@ struct BootNumbers {
     int values[256];
 };
 
+// A gap of numbers no folder holds (a folder made by hand) is not worth more.
+constexpr int PRUNE_RECORDS_MAX = 64;
+
 int collect_boot_number(void* arg, const char* name, int) {
     BootNumbers* numbers = static_cast<BootNumbers*>(arg);
     int n = other_mode_number(name);
@@ -111,9 +185,41 @@ int collect_boot_number(void* arg, const char* name, int) {
     return 0;
 }
 
+int by_number(const void* a, const void* b) {
+    int x = *static_cast<const int*>(a), y = *static_cast<const int*>(b);
+    return x < y ? -1 : x > y ? 1 : 0;
+}
+
+// Every number from the lowest to max - 2 goes, in ascending order, each with
+// its record, whether a folder holds it or not.
+void prune_other_modes(int dir, BootNumbers* numbers) {
+    if (numbers->count == 0) return;
+    qsort(numbers->values, static_cast<size_t>(numbers->count), sizeof(int), by_number);
+    int next = 0, recorded = 0, unrecorded = 0;
+    for (int n = numbers->values[0]; n <= numbers->max - 2; n++) {
+        bool present = false;
+        for (; next < numbers->count && numbers->values[next] <= n; next++) present |= numbers->values[next] == n;
+        if (!present && recorded >= PRUNE_RECORDS_MAX) {
+            unrecorded++;
+            continue;
+        }
+        recorded++;
+        HLOG(TAG_MAIN, WLOG_ERROR, "rm -r %s%d", OTHER_MODE_FOLDER, n);
+        char name[16];
+        snprintf(name, sizeof(name), "%d", n);
+        if (present && safe_remove_tree(dir, name) != 0 && errno != ENOENT) {
+            int err = errno;
+            HLOG(TAG_MAIN, WLOG_ERROR, "rm -r %s%d failed(%s)", OTHER_MODE_FOLDER, n, strerror(err));
+        }
+    }
+    if (unrecorded > 0)
+        HLOG(TAG_MAIN, WLOG_ERROR, "%d more numbers up to %d held no folder", unrecorded, numbers->max - 2);
+}
+
 // The number of this boot's folder: one past the highest of the earlier
-// boots, whose two newest folders are kept. -1 when they cannot be listed.
-int next_other_mode_number() {
+// boots, whose two newest folders are kept. A daemon restarted within the boot
+// goes on in its boot's folder and removes nothing. -1 when they cannot be listed.
+int next_other_mode_number(bool restarted) {
     if (!exists(OTHER_MODE_FOLDER)) return 1;
     BootNumbers numbers;
     UniqueFd dir(safe_open_dir("/data", OTHER_MODE_FOLDER, false, 0));
@@ -121,17 +227,11 @@ int next_other_mode_number() {
         HLOG(TAG_MAIN, WLOG_ERROR, "opendir /data/log_otherboot failed");
         return -1;
     }
-    for (int i = 0; i < numbers.count; i++) {
-        int n = numbers.values[i];
-        if (n > numbers.max - 2) continue;
-        char name[16];
-        snprintf(name, sizeof(name), "%d", n);
-        HLOG(TAG_MAIN, WLOG_ERROR, "rm -r %s%d", OTHER_MODE_FOLDER, n);
-        if (safe_remove_tree(dir.get(), name) != 0 && errno != ENOENT) {
-            int err = errno;
-            HLOG(TAG_MAIN, WLOG_ERROR, "rm -r %s%d failed(%s)", OTHER_MODE_FOLDER, n, strerror(err));
-        }
+    if (restarted && numbers.max > 0) {
+        HLOG(TAG_MAIN, WLOG_ERROR, "restarted within this boot, %s%d/ kept", OTHER_MODE_FOLDER, numbers.max);
+        return numbers.max;
     }
+    prune_other_modes(dir.get(), &numbers);
     return numbers.max + 1;
 }
 
@@ -143,13 +243,15 @@ void other_boot(LogController* controller, ConfigCache* config) {
         return;
     }
     copy_str(controller->logpath, sizeof(controller->logpath), "/data");
-    int number = next_other_mode_number();
+    remove_stray("log_other_mode");
+    int number = next_other_mode_number(restarted_in_this_boot());
     if (number < 0) return;
     snprintf(controller->run_folder, sizeof(controller->run_folder), "%s%d/", OTHER_MODE_FOLDER, number);
     if (create_run_folder(controller, "/data", controller->run_folder) < 0) {
         HLOG(TAG_MAIN, WLOG_ERROR, "mkdir %s failed", controller->run_folder);
         return;
     }
+    property_set(PROP_BOOTED, "1");
     HLOG(TAG_MAIN, WLOG_ERROR, "%s", controller->run_folder);
     bluetooth_off(controller);
     controller->boot_copy_timer = 0;
@@ -168,21 +270,18 @@ int start_in_temp_folder(LogController* controller) {
         return 1;
     }
     data_storage_low = 0;
-    // What an earlier boot left there was not wanted on the card; what this
-    // boot's earlier daemon held there is, and is appended to.
-    char booted[PROPERTY_VALUE_MAX];
-    property_get(PROP_BOOTED, booted, "0");
-    if (strcmp(booted, "1") == 0) {
+    remove_stray("log_temp");
+    // What this boot's earlier daemon held there is appended to.
+    if (restarted_in_this_boot()) {
         if (exists(TEMP_FOLDER)) HLOG(TAG_MAIN, WLOG_ERROR, "restarted within this boot, %s kept", TEMP_FOLDER);
-    } else if (exists(TEMP_FOLDER)) {
-        UniqueFd data(safe_open_dir("/data", "/data", false, 0));
-        if (!data.ok() || safe_remove_tree(data.get(), "log_temp") != 0) {
-            int err = errno;
-            HLOG(TAG_MAIN, WLOG_ERROR, "rm -r /data/log_temp failed(%s)", strerror(err));
-        }
+    } else {
+        keep_previous_boot();
     }
     if (create_run_folder(controller, "/data", TEMP_FOLDER) < 0) {
-        HLOG(TAG_MAIN, WLOG_ERROR, "mkdir %s faild,errno=%d", TEMP_FOLDER, errno);
+        int err = errno;
+        HLOG(TAG_MAIN, WLOG_ERROR, "mkdir %s faild,errno=%d", TEMP_FOLDER, err);
+        // With nothing held the boot-copy wait would only make an empty folder on the card.
+        if (!exists(PREV_BOOT_FOLDER)) controller->boot_copy_timer = 0;
         return 0;
     }
     property_set(PROP_BOOTED, "1");

@@ -8,6 +8,7 @@ class LogController;
 // socket. Returns once the control thread runs.
 void boot_start(LogController* controller, int boot_mode);
 
-// Points the run at /data/log_temp/ and prepares that folder; sets
+// Points the run at /data/log_temp/ and prepares that folder, keeping what
+// the boot before held there and never copied in /data/log_temp_prev/; sets
 // data_storage_low. 0 when the folder cannot be made.
 int start_in_temp_folder(LogController* controller);

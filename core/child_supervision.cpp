@@ -46,11 +46,15 @@ static void note_death(LogController* controller, pid_t* pid, int slot) {
 
 static bool is_dead(pid_t pid) { return kill(pid, 0) != 0; }
 
-void check_children(LogController* controller) {
+void reap_children() {
     pid_t pid;
     while ((pid = waitpid(-1, nullptr, WNOHANG)) > 0) {
         HLOG(TAG_MAIN, WLOG_ERROR, " pid %d send sig_chld ", pid);
     }
+}
+
+void check_children(LogController* controller) {
+    reap_children();
 
     if (all_pids_clear(controller)) {
         HLOG(TAG_MAIN, WLOG_ERROR, "all processes die, no need to check");
@@ -79,6 +83,8 @@ void check_children(LogController* controller) {
         note_death(controller, &controller->blog_pid, SLOT_BT);
     }
 
+    // A death is otherwise silent while the others go on: it shows in the property.
+    publish_collectors(controller);
     if (all_pids_clear(controller)) {
         HLOG(TAG_MAIN, WLOG_ERROR, "all chil processes die");
         reply_client(controller, -1, "tqlog_stopped");

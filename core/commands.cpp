@@ -19,6 +19,7 @@
 #include "platform/properties.h"
 #include "storage/debug_dump.h"
 #include "storage/history_log.h"
+#include "transist/transist.h"
 
 // Size in MB of the run that carries logging through a fast power-off.
 static constexpr int HBR_LOG_MB = 60;
@@ -62,8 +63,13 @@ static void load_path_and_size(LogController* controller) {
 }
 
 // Loads the options and names and creates the run folder. Returns 1, or 0
-// when the folder cannot be created.
+// when the folder cannot be created or the collectors could not be served.
 static int prepare_run(LogController* controller) {
+    // A run whose collectors cannot reach the transist records nothing.
+    if (!transist_listen()) {
+        HLOG(TAG_MAIN, WLOG_ERROR, "log_socket cannot be served, no run started");
+        return 0;
+    }
     ConfigCache cache;
     config_init(&cache);
     config_load(&cache);
@@ -277,7 +283,7 @@ static const char* config_fault(const char* key, const char* value) {
         value_len >= static_cast<size_t>(CONFIG_FIELD_LEN) || key_len + value_len > 97) {
         return "too long";
     }
-    if (strcmp(key, "logpath") == 0 && !log_path_value_valid(value)) return "not an absolute path";
+    if (strcmp(key, "logpath") == 0) return log_path_value_fault(value);
     return nullptr;
 }
 
@@ -322,6 +328,6 @@ int apply_config_message(LogController* controller, char* text) {
     WLOG(TAG_MAIN, WLOG_DEBUG, "new config, key: %s, value:%s", real_key, value);
     ConfigCache cache;
     config_init(&cache);
-    config_change(&cache, real_key, value);
-    return 1;
+    // A setting the file did not take is not stored, whatever the cache says.
+    return config_change(&cache, real_key, value);
 }

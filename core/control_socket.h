@@ -19,5 +19,6 @@ int handle_client_message(LogController* controller, int fd);
 // Writes text to the client fd, or to every connected client when fd is -1.
 void reply_client(LogController* controller, int fd, const char* text);
 // Applies one key=value message. Returns 0 when it was refused as unsafe to
-// store (a line feed, too long, a logpath that is no absolute path), else 1.
+// store (a line feed, too long, a logpath that cannot be used) or the file
+// could not be written, else 1.
 int apply_config_message(LogController* controller, char* text);

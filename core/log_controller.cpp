@@ -27,6 +27,7 @@ LogController::LogController() {
     pthread_mutex_init(&client_lock, nullptr);
     pthread_mutex_init(&reply_lock, nullptr);
     property_set(PROP_RUNNING, "0");
+    property_set(PROP_COLLECTORS, "");
     // EFD_CLOEXEC keeps the counters out of the shell commands the daemon runs.
     efd_chld = eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC);
     if (efd_chld < 0) HLOG(TAG_MAIN, WLOG_ERROR, "create efd_chld failed(%s)", strerror(errno));

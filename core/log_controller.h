@@ -74,6 +74,15 @@ extern int data_storage_low;
 #define PROP_RUNNING "debug.TQ.running"
 #define PROP_REALPATH "debug.TQ.realpath"
 #define PROP_LOGSIZE "debug.TQ.logsize"
+// Which collectors of the run are alive, in the fixed order of the log types:
+// "main=up,radio=up,events=up,kernel=down,bt=off" (up: running; down: enabled
+// but ended, or never started; off: not enabled for this run); "" while no run
+// is active. Updated at run start, at each death and at stop.
+#define PROP_COLLECTORS "debug.TQ.collectors"
+// "SECONDS.NANOS": the wall-clock time at which the boot clock read zero, set at
+// every run start and folder switch, so that the run's properties dump lets a
+// reader give the kernel's lines (timed since boot) their wall-clock time.
+#define PROP_BOOT_WALLCLOCK "debug.TQ.boot_wallclock"
 // Set once a daemon of this boot has made /data/log_temp: a daemon restarted
 // by init finds the same boot's held logs there and keeps them.
 #define PROP_BOOTED "debug.TQ.booted"

@@ -24,16 +24,22 @@
 #include "common/io_util.h"
 #include "common/unique_fd.h"
 #include "common/wlog.h"
+#include "config/log_path.h"
 #include "core/child_supervision.h"
 #include "core/log_controller.h"
 #include "platform/properties.h"
 #include "storage/folder_records.h"
 #include "storage/history_log.h"
+#include "storage/record_limit.h"
 #include "storage/safe_file.h"
 #include "transist/transist.h"
 
 #define RUN_FOLDER_ROOT "/qrvlog/tavlolog/"
 #define RUN_FOLDER_PATTERN "APLog_%Y_%m%d_%H%M%S/"
+
+// Every run folder below a usable log path can be published in a property.
+static_assert(LOG_PATH_MAX_LEN + sizeof(RUN_FOLDER_ROOT "APLog_2026_0304_070649/") - 1 == PROP_VALUE_LEN - 1,
+              "log path limit and run folder name disagree");
 
 constexpr useconds_t STOP_STEP_US = 100000;
 // Polls of `exited` after SIGUSR1: the collectors get at most 0.9 s.
@@ -61,6 +67,41 @@ void compose_run_folder(LogController* controller) {
     HLOG(TAG_MAIN, WLOG_INFO, "full path is:%s", controller->run_folder);
 }
 
+// Any app that can write the card can plant links there, as often as it likes.
+static RecordLimit removed_links = RECORD_LIMIT(TAG_MAIN, "removed links");
+
+// A link where the daemon's own folders ("qrvlog", "tavlolog") belong would be
+// refused, and so block every run until someone removed it: the link itself
+// goes (never what it points to), and the folder is made in its place.
+static void remove_planted_links(const char* base, const char* folder) {
+    size_t base_len = strlen(base);
+    while (base_len > 0 && base[base_len - 1] == '/') base_len--;
+    char own[PATH_LEN];
+    int own_len = snprintf(own, sizeof(own), "%.*s" RUN_FOLDER_ROOT, static_cast<int>(base_len), base);
+    if (own_len < 0 || own_len >= PATH_LEN || strncmp(folder, own, static_cast<size_t>(own_len)) != 0) return;
+    // The base is trusted as it stands, links and all.
+    UniqueFd dir(RETRY_EINTR(open(base_len == 0 ? "/" : base, O_PATH | O_DIRECTORY | O_CLOEXEC)));
+    size_t shown_len = base_len;
+    static const char* const OWN_FOLDERS[] = {"qrvlog", "tavlolog"};
+    for (const char* name : OWN_FOLDERS) {
+        shown_len += 1 + strlen(name);
+        struct stat st;
+        if (!dir.ok() || fstatat(dir.get(), name, &st, AT_SYMLINK_NOFOLLOW) != 0) return;
+        if (S_ISLNK(st.st_mode)) {
+            if (safe_remove_file(dir.get(), name) == 0) {
+                HLOG_LIMITED(removed_links, TAG_MAIN, WLOG_WARN, "%.*s is a symbolic link, removed",
+                             static_cast<int>(shown_len), own);
+            } else {
+                int err = errno;
+                HLOG_LIMITED(removed_links, TAG_MAIN, WLOG_ERROR, "remove link %.*s failed(%s)",
+                             static_cast<int>(shown_len), own, strerror(err));
+            }
+            return;
+        }
+        dir.reset(RETRY_EINTR(openat(dir.get(), name, O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC)));
+    }
+}
+
 int create_run_folder(LogController* controller, const char* base, const char* path) {
     char folder[PATH_LEN];
     size_t len = strnlen(path, PATH_LEN);
@@ -68,12 +109,14 @@ int create_run_folder(LogController* controller, const char* base, const char* p
     if (len + (needs_slash ? 1 : 0) >= static_cast<size_t>(PATH_LEN)) {
         HLOG(TAG_MAIN, WLOG_ERROR, "mkdir %.64s... refused: longer than %d characters", path,
              PATH_LEN - 1);
+        errno = ENAMETOOLONG;
         return -1;
     }
     memcpy(folder, path, len);
     if (needs_slash) folder[len++] = '/';
     folder[len] = '\0';
 
+    remove_planted_links(base, folder);
     // base is trusted as it stands (a log path may be a link); below it an
     // app that can write the card may have planted links: none is followed.
     char failed_at[PATH_LEN];
@@ -82,10 +125,12 @@ int create_run_folder(LogController* controller, const char* base, const char* p
         int err = path[0] == '\0' ? EINVAL : errno;
         if (err == EINVAL && failed_at[0] == '\0') {
             HLOG(TAG_MAIN, WLOG_ERROR, "mkdir %s refused: not under %s", folder, base);
+            errno = EINVAL;
             return -1;
         }
         HLOG(TAG_MAIN, WLOG_ERROR, "mkdir %s fails, errno:%s(%d)", failed_at, strerror(err), err);
         HLOG(TAG_MAIN, WLOG_ERROR, "mkdir %s fails at last", folder);
+        errno = err;  // the records may have changed it; the caller reports it
         return -1;
     }
     HLOG(TAG_MAIN, WLOG_INFO, "mkdir %s success", folder);
@@ -108,6 +153,20 @@ int calc_rotate_size(LogController* controller, int megabytes) {
     // 64-bit: a large configured size must not wrap into a negative limit.
     int64_t kb = static_cast<int64_t>(megabytes) * 1024 / controller->log_file_num;
     return kb > INT_MAX ? INT_MAX : static_cast<int>(kb);
+}
+
+// The kernel stamps its lines with its clock since boot, which stops while the
+// phone sleeps as CLOCK_MONOTONIC does; taken again at each run start and
+// folder switch, the value follows a changed wall clock or a sleep from then on.
+static void publish_boot_wallclock() {
+    struct timespec real, boot;
+    clock_gettime(CLOCK_REALTIME, &real);
+    clock_gettime(CLOCK_MONOTONIC, &boot);
+    int64_t ns = (static_cast<int64_t>(real.tv_sec) - boot.tv_sec) * 1000000000 + (real.tv_nsec - boot.tv_nsec);
+    char value[32];
+    snprintf(value, sizeof(value), "%lld.%09lld", static_cast<long long>(ns / 1000000000),
+             static_cast<long long>(ns % 1000000000));
+    property_set(PROP_BOOT_WALLCLOCK, value);
 }
 
 static void set_logsize_property(int rotate_kb) {
@@ -154,6 +213,28 @@ static void create_control_block(LogController* controller) {
     WLOG(TAG_MAIN, WLOG_DEBUG, "create shared memory ok!");
 }
 
+void publish_collectors(const LogController* controller) {
+    const struct {
+        const char* name;
+        int enabled;
+        pid_t pid;
+    } collectors[LOG_TYPE_COUNT] = {
+        {"main", controller->android_log, controller->mlog_pid},
+        {"radio", controller->android_log, controller->rlog_pid},
+        {"events", controller->android_log, controller->elog_pid},
+        {"kernel", controller->kernel_log, controller->klog_pid},
+        {"bt", controller->bt_log, controller->blog_pid},
+    };
+    char value[PROPERTY_VALUE_MAX] = {};  // at most 52 characters
+    size_t used = 0;
+    for (const auto& c : collectors) {
+        const char* state = !c.enabled ? "off" : c.pid != 0 ? "up" : "down";
+        int n = snprintf(value + used, sizeof(value) - used, "%s%s=%s", used ? "," : "", c.name, state);
+        if (n > 0) used += static_cast<size_t>(n);
+    }
+    property_set(PROP_COLLECTORS, value);
+}
+
 static void mark_not_started(LogController* controller, int slot) {
     controller->shm->slots[slot].exited = 1;
 }
@@ -167,6 +248,7 @@ void start_logging(LogController* controller) {
     sigaction(SIGCHLD, &sa, nullptr);
 
     if (controller->boot_mode == 0) oru_mode_on();
+    publish_boot_wallclock();
     set_logsize_property(controller->rotate_size_kb);
     property_set(PROP_RUNNING, "1");
     controller->run_active = true;
@@ -196,6 +278,7 @@ void start_logging(LogController* controller) {
 
     HLOG(TAG_MAIN, WLOG_INFO, "M(%d),R(%d),E(%d),K(%d),B(%d)", controller->mlog_pid,
          controller->rlog_pid, controller->elog_pid, controller->klog_pid, controller->blog_pid);
+    publish_collectors(controller);
 }
 
 static bool all_collectors_exited(const LogController* controller) {
@@ -261,7 +344,11 @@ static void discard_stale_notices() {
 
 void stop_logging(LogController* controller) {
     // The collectors ended below are reaped by the system and start no check.
+    // One that died before (its notice not handled yet) is still a zombie,
+    // which the system leaves: it is reaped here with its record, not
+    // silently by the signalling below.
     signal(SIGCHLD, SIG_IGN);
+    reap_children();
     // The daemon's own record decides: the property may have been set by hand.
     if (!controller->run_active) {
         controller->log_path_state = -1;
@@ -270,6 +357,7 @@ void stop_logging(LogController* controller) {
         return;
     }
     property_set(PROP_RUNNING, "0");
+    property_set(PROP_COLLECTORS, "");
 
     if (controller->shm != nullptr) {
         int locked = control_block_lock(controller->sem);
@@ -315,6 +403,7 @@ void publish_run_folder(LogController* controller, const char* path) {
 
 void switch_run_folder(LogController* controller, const char* path) {
     publish_run_folder(controller, path);
+    publish_boot_wallclock();
     set_logsize_property(controller->rotate_size_kb);
     change_log_folder(path, controller->rotate_size_kb);
     sleep(1);

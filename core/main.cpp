@@ -11,6 +11,7 @@
 #include "core/privileges.h"
 #include "platform/properties.h"
 #include "storage/history_log.h"
+#include "transist/transist.h"
 
 int main() {
     // A client or collector that has gone must give EPIPE, not end the daemon.
@@ -29,6 +30,10 @@ int main() {
 
     history_log(0, "****** TQLOG START *******");
     WLOG(TAG_DEBUG, WLOG_INFO, "****** TQLOG START *******");
+
+    // Before any app runs: an app that bound "log_socket" first would keep
+    // every run from recording. Held for the daemon's life.
+    transist_listen();
 
     // Every file and folder gets exactly the mode it is created with.
     umask(0);

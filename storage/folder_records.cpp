@@ -258,6 +258,10 @@ int update_folder_records(const char* root, const char* run_folder, int location
     FolderRecord* records = read_folder_records(location);
     UniqueFd dir(safe_open_dir(root, parent, false, 0));
     bool failed = !dir.ok();
+    if (failed) {
+        int err = errno;
+        HLOG(TAG_SIZE, WLOG_ERROR, "open %s fail %s", parent, strerror(err));
+    }
     FolderRecord* entries = failed ? nullptr : list_folder_entries(dir.get(), parent, &failed);
     if (failed) {
         HLOG(TAG_SIZE, WLOG_ERROR, "read cur path folder info fail");

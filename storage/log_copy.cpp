@@ -10,6 +10,7 @@
 
 #include "common/io_util.h"
 #include "common/limits.h"
+#include "common/log_types.h"
 #include "common/unique_fd.h"
 #include "common/wlog.h"
 #include "core/log_controller.h"
@@ -60,6 +61,31 @@ bool exists(const char* path) {
     return lstat(path, &st) == 0;
 }
 
+// "<type>" or "<type>.1" to "<type>.4": a name the run itself writes in its
+// folder. A copy appended there would share a file with the writer.
+bool named_like_run_output(const char* name) {
+    for (int t = 0; t < LOG_TYPE_COUNT; t++) {
+        const char* type = log_type_name(t);
+        size_t len = strlen(type);
+        if (strncmp(name, type, len) != 0) continue;
+        const char* rest = name + len;
+        if (rest[0] == '\0' || (rest[0] == '.' && rest[1] >= '1' && rest[1] <= '0' + OLDEST_PIECE && rest[2] == '\0'))
+            return true;
+    }
+    return false;
+}
+
+// Whether src_dir holds the current file or an older piece of the log name.
+bool holds_pieces(const char* src_dir, const char* name) {
+    char piece[PATH_LEN + 8];
+    for (int n = 0; n <= OLDEST_PIECE; n++) {
+        int len = n == 0 ? snprintf(piece, sizeof(piece), "%s%s", src_dir, name)
+                         : snprintf(piece, sizeof(piece), "%s%s.%d", src_dir, name, n);
+        if (len >= 0 && static_cast<size_t>(len) < sizeof(piece) && exists(piece)) return true;
+    }
+    return false;
+}
+
 struct NameList {
     char (*names)[NAME_MAX + 1] = nullptr;
     int count = 0;
@@ -67,10 +93,11 @@ struct NameList {
     ~NameList() { free(names); }
 };
 
-// Names not beginning with '.', in listing order.
+// Names not beginning with '.', in listing order. A held piece of a log that
+// stayed where it was is left for a later copy into its own suffixed file.
 int collect_name(void* arg, const char* name, int) {
     NameList* list = static_cast<NameList*>(arg);
-    if (name[0] == '.') return 0;
+    if (name[0] == '.' || named_like_run_output(name)) return 0;
     if (list->count == list->cap) {
         int cap = list->cap == 0 ? 32 : list->cap * 2;
         void* bigger = realloc(list->names, static_cast<size_t>(cap) * sizeof(*list->names));
@@ -167,16 +194,20 @@ CopyResult copy_rotated_log(LogController* controller, const char* src_dir, cons
     char base[PATH_LEN];
     char dst[PATH_LEN];
     if (!join(base, src_dir, name) || !join(dst, dst_dir, name, suffix)) return COPY_KEPT;
-    // Oldest piece first. A piece that stays keeps the newer ones back too, so
-    // that a later copy still appends them in order.
+    // Oldest piece first. A piece that cannot be read stays for a later copy;
+    // the newer ones still go here, the one file of this log the writer never
+    // touches.
+    CopyResult result = COPY_DONE;
     for (int n = OLDEST_PIECE; n >= 1; n--) {
         char piece[PATH_LEN + 8];
         snprintf(piece, sizeof(piece), "%s.%d", base, n);
         if (!exists(piece)) continue;
         CopyResult rc = copy_log_file(controller, piece, dst);
-        if (rc != COPY_DONE) return rc;
+        if (rc == COPY_ABORT) return rc;
+        if (rc == COPY_KEPT) result = COPY_KEPT;
     }
-    return copy_log_file(controller, base, dst);
+    CopyResult rc = copy_log_file(controller, base, dst);
+    return rc == COPY_DONE ? result : rc;
 }
 
 CopyResult copy_log_folder(LogController* controller, const char* src_dir, const char* dst_dir,
@@ -191,7 +222,10 @@ CopyResult copy_log_folder(LogController* controller, const char* src_dir, const
                  {controller->android_log, "radio_log"},
                  {controller->bt_log, "bt_log"}};
     for (const auto& type : types) {
-        if (type.on && copy_rotated_log(controller, src_dir, dst_dir, type.name, suffix) == COPY_ABORT)
+        // A log switched off now may hold pieces from when it was on: they too
+        // go into its suffixed file, never under a name the run writes.
+        if (!type.on && !holds_pieces(src_dir, type.name)) continue;
+        if (copy_rotated_log(controller, src_dir, dst_dir, type.name, suffix) == COPY_ABORT)
             return COPY_ABORT;
     }
     return copy_remaining_files(controller, src_dir, dst_dir);

@@ -8,8 +8,22 @@
 #include "collectors/bt_cat.h"
 #include "collectors/collector_link.h"
 #include "collectors/kmsg_cat.h"
+#include "collectors/log_cat.h"
 #include "test_util.h"
 #include "transist/transist.h"
+
+// Linked in place of read (--wrap): a collector child sets these to make its
+// next reads of a chunk fail as a blocking read may, without taking anything.
+static int spurious_errors[2];
+static int spurious_left = 0;
+extern "C" ssize_t __real_read(int fd, void* buf, size_t n);
+extern "C" ssize_t __wrap_read(int fd, void* buf, size_t n) {
+    if (n == 255 && spurious_left > 0) {
+        errno = spurious_errors[--spurious_left];
+        return -1;
+    }
+    return __real_read(fd, buf, n);
+}
 
 namespace {
 
@@ -40,6 +54,7 @@ class LinkTest : public ::testing::Test {
         run_.reset();
         connect_retry_us = 10000;
         BtCat::pause_us = 2000;
+        failed_wait_pause_us = 50000;
     }
     // Runs body in a child that ends with status 77 if body returns.
     template <typename Body>
@@ -122,6 +137,59 @@ TEST_F(LinkTest, RefusesALogSocketServedByAnotherProcess) {
     expect_end(pid, SLOT_KERNEL, 1, 1, REASON_NONE);
     EXPECT_TRUE(exits_with(squatter, 0)) << "the squatter received data";
     EXPECT_EQ(count_of(read_file(kHistory), "log_socket is served by pid " + std::to_string(squatter)), 5u);
+}
+
+// CPU time of process pid so far, in milliseconds.
+long cpu_ms(pid_t pid) {
+    std::string stat = read_file("/proc/" + std::to_string(pid) + "/stat");
+    unsigned long user = 0, system = 0;
+    size_t name_end = stat.rfind(')');
+    if (name_end == std::string::npos ||
+        sscanf(stat.c_str() + name_end + 1, " %*c %*d %*d %*d %*d %*d %*u %*u %*u %*u %*u %lu %lu", &user,
+               &system) != 2)
+        return -1;
+    return static_cast<long>((user + system) * 1000 / static_cast<unsigned long>(sysconf(_SC_CLK_TCK)));
+}
+
+// A wait that keeps failing (here on a closed descriptor) is recorded once,
+// and the collector pauses between tries instead of spinning: over half a
+// second of failures it stays mostly asleep. The stop signal still ends it.
+TEST_F(LinkTest, AWaitThatKeepsFailingIsRecordedOnceAndDoesNotSpin) {
+    const struct {
+        char letter;
+        int slot;
+    } cases[] = {{'K', SLOT_KERNEL}, {'M', SLOT_MAIN}, {'B', SLOT_BT}};
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.letter);
+        run_.reset();
+        unlink(kHistory);
+        pid_t pid = fork_child([&] {
+            int closed = dup(0);
+            close(closed);
+            KmsgCat kernel;
+            LogCat android("main_log");
+            BtCat bt;
+            CollectorLink* link = c.letter == 'K' ? static_cast<CollectorLink*>(&kernel)
+                                  : c.letter == 'M' ? static_cast<CollectorLink*>(&android)
+                                                    : &bt;
+            link->shm_fd = run_.fd;
+            install_stop_signal(link);
+            if (!attach_control_block(link)) _exit(99);
+            if (c.letter == 'K') kernel.forward(closed);
+            android.add_device("/dev/log/main", false, LOG_ID_MAIN, closed);
+            if (c.letter == 'M') android.read_log_lines();
+            bt.mSockListenId = closed;
+            bt.forward();
+        });
+        const std::string record = std::string(1, c.letter) + ": select failed: Bad file descriptor(9)";
+        ASSERT_TRUE(wait_for([&] { return history_has(record); }, 5000));
+        long before = cpu_ms(pid);
+        usleep(500000);
+        EXPECT_LT(cpu_ms(pid) - before, 50) << "it spins";
+        kill(pid, SIGUSR1);
+        expect_end(pid, c.slot, 0, 1, REASON_SIGNAL);
+        EXPECT_EQ(count_of(read_file(kHistory), record), 1u);
+    }
 }
 
 // The kernel collector with the test serving "log_socket".
@@ -216,12 +284,18 @@ class BtCatTest : public LinkTest {
   protected:
     void SetUp() override {
         LinkTest::SetUp();
-        pid_ = fork_child([&] { BtCat().run("bt_log", run_.fd); });
+        pid_ = fork_child([&] {
+            spurious_errors[0] = EINTR;  // the first two reads fail, EAGAIN then EINTR
+            spurious_errors[1] = EAGAIN;
+            spurious_left = 2;
+            BtCat().run("bt_log", run_.fd);
+        });
     }
     pid_t pid_ = -1;
 };
 
-// Late service, then a chunk longer than one read, then the service ends.
+// Late service, then spurious read failures and a chunk longer than one read,
+// then the service ends.
 TEST_F(BtCatTest, ForwardsTheLateServiceExactlyAndEndsWhenItCloses) {
     ASSERT_TRUE(wait_for([] { return history_has("mSockListenId<0 , errno = 111"); }, 5000));
     int service = server(BT_LOG_SOCKET_NAME), transist = server(LOG_SOCKET_NAME);

@@ -96,6 +96,7 @@ TEST_F(ConfigTest, ValueBecomesADirectory) {
         {"/mnt/sdcard/../../data", "/storage/int", "", "/storage/int",
          "log path /mnt/sdcard/../../data is not an absolute path, internal_sd used"},
         {"internal_sd", "tmp", "", "/mnt/sdcard", "cant get log path through property internal_sd_path"},
+        {"/data/misc/tqlog", "/storage/int", "", "/storage/int", "log path /data/misc/tqlog is the daemon's own folder, internal_sd used"},
     };
     for (const auto& c : cases) {
         SCOPED_TRACE(c.expected);

@@ -64,22 +64,39 @@ class ControlSocketTest : public ::testing::Test {
     LogController* controller = nullptr;
 };
 
-// A message unsafe to store is refused whole (the message fuzzer checks the rules at large).
-TEST_F(ControlSocketTest, UnsafeMessagesAreRefusedAndStoreNothing) {
+int squatter = -1;  // an app's socket holding "log_socket"
+
+// A message unsafe to store, or one that cannot be carried out, is refused
+// whole: ",0", the file as it was, no run (the message fuzzer checks the rules at large).
+TEST_F(ControlSocketTest, RefusedMessagesChangeNothing) {
+    const std::string too_long = "logpath=/mnt/" + std::string(47, 'p');  // a 52-character path
     const struct {
         std::string bytes, reply;  // exactly what the client writes; the text before ",0"
         const char* record;
+        void (*setup)();
     } cases[] = {
-        {std::string("AndroidLog=0\0start\0", 19), "AndroidLog=0", "(NUL byte)"},
+        {std::string("AndroidLog=0\0start\0", 19), "AndroidLog=0", "(NUL byte)", nullptr},
         {std::string("logsize=1\nlogpath=/x\0", 21), "logsize=1\nlogpath=/x",
-         "logsize=1\\x0alogpath=/x is not a valid configure (line feed)"},
+         "logsize=1\\x0alogpath=/x is not a valid configure (line feed)", nullptr},
+        {std::string("logpath=/data/misc//tqlog/logs\0", 31), "logpath=/data/misc//tqlog/logs",
+         "(the daemon's own folder)", nullptr},
+        {too_long + '\0', too_long, "(too long for a run folder)", nullptr},
+        {std::string("BTLog=1\0", 8), "BTLog=1", "cant open the config file,errno=17",
+         [] { mkdir(CONFIG_FILE ".tmp", 0700); }},
+        {std::string("start\0", 6), "start", "log_socket cannot be served, no run started",
+         [] { squatter = socket_local_server("log_socket", ANDROID_SOCKET_NAMESPACE_ABSTRACT, SOCK_STREAM); }},
+        // Without a file the default "1" is no change, and still not stored.
+        {std::string("BTLog=1\0", 8), "BTLog=1", "some thing wrong when read",
+         [] { unlink(CONFIG_FILE), mkdir(CONFIG_FILE, 0700); }},
     };
     for (const auto& c : cases) {
+        if (c.setup) c.setup();
+        std::string before = read_file(CONFIG_FILE);
         auto conn = connect_client();
         EXPECT_EQ(c.reply + REPLY_FAILED, exchange_raw(conn.get(), c.bytes, c.reply));
-        EXPECT_EQ(kBaseConfig, read_file(CONFIG_FILE));
+        EXPECT_EQ(before, read_file(CONFIG_FILE));
         EXPECT_TRUE(history_has(c.record)) << c.record << "\n" << read_file(kHistory);
-        EXPECT_NE("1", property(PROP_RUNNING)) << "the start after the NUL byte ran";
+        EXPECT_NE("1", property(PROP_RUNNING)) << "a run started";
     }
 }
 

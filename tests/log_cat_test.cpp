@@ -3,6 +3,7 @@
 #include "collectors/log_cat.h"
 
 #include <poll.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 
 #include <sstream>
@@ -10,13 +11,23 @@
 #include "platform/logger_write.h"
 #include "test_util.h"
 
+// Linked in place of the library's call (--wrap): rendering an entry whose
+// message is "unrenderable" fails, as when the library finds no memory for a long line.
+extern "C" char* __real_android_log_formatLogLine(AndroidLogFormat*, char*, size_t, const AndroidLogEntry*, size_t*);
+extern "C" char* __wrap_android_log_formatLogLine(AndroidLogFormat* format, char* buf, size_t size,
+                                                  const AndroidLogEntry* line, size_t* len) {
+    if (line->messageLen >= 12 && strncmp(line->message, "unrenderable", 12) == 0) return nullptr;
+    return __real_android_log_formatLogLine(format, buf, size, line, len);
+}
+
 namespace {
 
 const char kOut[] = "/tmp/logcat_out";
 
-std::string entry(int32_t ms, const std::string& message, int priority = 4, int32_t pid = 100) {
+// An entry dated ms milliseconds after second base, written by pid.
+std::string entry(int32_t ms, const std::string& message, uint32_t base = 0, int32_t pid = 100) {
     char raw[LOGGER_READ_MAX];
-    size_t n = make_legacy_text_entry(raw, pid, 101, ms / 1000, (ms % 1000) * 1000000u, priority, "t",
+    size_t n = make_legacy_text_entry(raw, pid, 101, base + ms / 1000, (ms % 1000) * 1000000u, 4, "t",
                                       message.c_str());
     return std::string(raw, n);
 }
@@ -97,33 +108,68 @@ TEST(LogCatMerge, SendsInTimeOrderAndHoldsALoneEntryUntilItIsSafe) {
     }
 }
 
-// A lone main entry while system streams on: once more than 10,000 entries or
-// more than the byte budget are held, a marker releases it (not before), the
-// backlog drains in order, and the marker line follows later.
-TEST(LogCatMerge, OverloadReleasesTheHeldEntryWithAMarker) {
-    for (size_t pad : {0, 4000}) {
-        Engine engine("MS");
-        std::string raw = entry(1000, "first");
-        engine.cat.take_entry(engine.device(0), raw.data(), raw.size());
-        std::string expect = "^main first ^system ";
-        int i = 0;
-        for (; engine.sent().empty(); i++) {
-            ASSERT_LT(i, 10000) << "never released, pad " << pad;
-            std::string message = "s" + std::to_string(i) + std::string(pad, 'x');
-            raw = entry(2000 + i, message);
-            engine.cat.take_entry(engine.device(1), raw.data(), raw.size());
-            bool over = engine.cat.queued_count > 9999 || engine.cat.queued_bytes > OVERLOAD_BYTES;
-            engine.cat.print_ready();
-            engine.cat.flush_output();
-            ASSERT_EQ(engine.sent().empty(), !over) << "entry " << i << ", pad " << pad;
-            if (!over) expect += message + " ";
+// A lone main entry while system streams on: at 10,000 held entries it is
+// released, the backlog drains in order, and each overload adds one marker,
+// dated now: last when the entries are older than the clock, first when the
+// clock has stepped back behind them. In a child with a time limit (and a file
+// size limit), as a collector that loops on its marker never ends.
+TEST(LogCatMerge, EachOverloadReleasesTheHeldEntryWithOneMarkerWhateverTheClock) {
+    const uint32_t now = static_cast<uint32_t>(time(nullptr));
+    for (uint32_t base : {now - 86400, now + 3600}) {
+        const bool stepped_back = base > now;
+        pid_t pid = fork();
+        if (pid == 0) {
+            alarm(20);
+            struct rlimit size = {1 << 23, 1 << 23};
+            setrlimit(RLIMIT_FSIZE, &size);
+            Engine engine("MS");
+            for (int round = 0; round < 2; round++) {
+                std::string raw = entry(round * 100000, "m" + std::to_string(round), base);
+                engine.cat.take_entry(engine.device(0), raw.data(), raw.size());
+                for (int i = 0; i < 10000; i++) {
+                    raw = entry(round * 100000 + 1000 + i, "s" + std::to_string(i), base);
+                    engine.cat.take_entry(engine.device(1), raw.data(), raw.size());
+                    engine.cat.print_ready();
+                }
+                engine.cat.print_all();
+            }
+            _exit(0);
         }
-        EXPECT_EQ(i == 9999, pad == 0) << "released after " << i << " entries, pad " << pad;
-        EXPECT_EQ(tokens(engine.sent()), expect);
-        engine.cat.print_all();
-        EXPECT_NE(lines_of(kOut).back().find("    0     0 W ORU     : trigger log"), std::string::npos)
-            << lines_of(kOut).back();
+        std::string expect;
+        for (int round = 0; round < 2; round++) {
+            expect += round == 0 ? "^main " : "";
+            expect += stepped_back ? "trigger log " : "";
+            expect += "m" + std::to_string(round) + " " + (round == 0 ? "^system " : "");
+            for (int i = 0; i < 10000; i++) expect += "s" + std::to_string(i) + " ";
+            expect += stepped_back ? "" : "trigger log ";
+        }
+        EXPECT_TRUE(exits_with(pid, 0, 30000)) << "the stream stopped moving, base " << base;
+        EXPECT_TRUE(tokens(read_file(kOut)) == expect) << "base " << base;
     }
+}
+
+// As at 10,000 entries, entries of the longest payload are released with a
+// marker once they take more than the byte budget, and not before.
+TEST(LogCatMerge, ByteBudgetReleasesTheHeldEntryWithAMarker) {
+    Engine engine("MS");
+    std::string raw = entry(1000, "first");
+    engine.cat.take_entry(engine.device(0), raw.data(), raw.size());
+    std::string expect = "^main first ^system ";
+    for (int i = 0; engine.sent().empty(); i++) {
+        ASSERT_LT(i, 9999) << "not released by the bytes";
+        std::string message = "s" + std::to_string(i) + std::string(4000, 'x');
+        raw = entry(2000 + i, message);
+        engine.cat.take_entry(engine.device(1), raw.data(), raw.size());
+        bool over = engine.cat.queued_bytes > OVERLOAD_BYTES;
+        engine.cat.print_ready();
+        engine.cat.flush_output();
+        ASSERT_EQ(engine.sent().empty(), !over) << "entry " << i;
+        if (!over) expect += message + " ";
+    }
+    EXPECT_EQ(tokens(engine.sent()), expect);
+    engine.cat.print_all();
+    EXPECT_NE(lines_of(kOut).back().find("    0     0 W ORU     : trigger log"), std::string::npos)
+        << lines_of(kOut).back();
 }
 
 // With a per-pid budget: "pid bytes ms" entries, each kept (+) or dropped (-);
@@ -175,10 +221,10 @@ TEST(LogCatMerge, FloodOptionKeepsEveryOtherWritersEntries) {
     engine.cat.flood.set_budget(4096);
     std::string expect;
     for (int i = 0; i < 40; i++) {
-        std::string raw = entry(1000 + i, "flood" + std::string(1000, 'x'), 4, 666);
+        std::string raw = entry(1000 + i, "flood" + std::string(1000, 'x'), 0, 666);
         engine.cat.take_entry(engine.device(0), raw.data(), raw.size());
         std::string message = "other" + std::to_string(i);
-        raw = entry(1000 + i, message, 4, 200 + i % 2);
+        raw = entry(1000 + i, message, 0, 200 + i % 2);
         engine.cat.take_entry(engine.device(i % 2), raw.data(), raw.size());
         engine.cat.print_ready();
     }
@@ -207,12 +253,13 @@ TEST(LogCatMerge, FloodOptionKeepsEveryOtherWritersEntries) {
 TEST(LogCatEnds, SendsWhatItReadBeforeItEnds) {
     const struct {
         const char* name;
-        bool close_system, stop_word, signal;
+        bool close_system, stop_word, signal, unrenderable;
         int status, reason;
     } cases[] = {
-        {"end of stream", true, false, false, 1, REASON_READ},
-        {"stop word", false, true, false, 0, REASON_NONE},
-        {"stop signal", false, false, true, 0, REASON_SIGNAL},
+        {"end of stream", true, false, false, false, 1, REASON_READ},
+        {"stop word", false, true, false, false, 0, REASON_NONE},
+        {"stop signal", false, false, true, false, 0, REASON_SIGNAL},
+        {"rendering fails", false, false, false, true, 1, REASON_OUTPUT},
     };
     for (const auto& c : cases) {
         RunBlock run;
@@ -224,6 +271,10 @@ TEST(LogCatEnds, SendsWhatItReadBeforeItEnds) {
         // The main entry is alone and older: the loop holds it back.
         for (auto [fd, raw] : {std::pair(main_pair[1], entry(1000, "m1")), std::pair(system_pair[1], entry(2000, "s1"))})
             ASSERT_EQ(write(fd, raw.data(), raw.size()), static_cast<ssize_t>(raw.size()));
+        std::string last = entry(3000, "unrenderable");
+        if (c.unrenderable) {
+            ASSERT_EQ(write(system_pair[1], last.data(), last.size()), static_cast<ssize_t>(last.size()));
+        }
         if (c.close_system) close(system_pair[1]);
         pid_t pid = fork();
         if (pid == 0) {

@@ -11,6 +11,7 @@
 #include "collectors/kmsg_cat.h"
 #include "config/config_store.h"
 #include "core/boot_mode.h"
+#include "core/boot_start.h"
 #include "core/child_supervision.h"
 #include "core/log_controller.h"
 #include "test_util.h"
@@ -61,7 +62,8 @@ TEST(CreateRunFolder, CreatesEveryMissingFolderWithGroupAccessOrRefuses) {
     umask(077);
     LogController controller;
     write_file("/data/blocker", "");
-    ASSERT_EQ(system("mkdir -p /data/elsewhere /mnt/sdcard/qrvlog && ln -s /data/elsewhere /mnt/sdcard/qrvlog/next"), 0);
+    ASSERT_EQ(system("mkdir -p /data/elsewhere /mnt/sdcard/qrvlog /mnt/sdcard/other && ln -s /data/elsewhere /mnt/sdcard/qrvlog/next"
+                     " && ln -s /data/elsewhere /mnt/sdcard/qrvlog/tavlolog && ln -s /data/elsewhere /mnt/sdcard/other/qrvlog"), 0);
     const std::string too_long = "/data/" + std::string(249, 'y'), too_long_part = too_long.substr(0, 200);
     const struct {
         const char *base, *path;
@@ -73,6 +75,9 @@ TEST(CreateRunFolder, CreatesEveryMissingFolderWithGroupAccessOrRefuses) {
         {"/mnt/sdcard/deep", "/mnt/sdcard/deep/a/b/c", 1, "/mnt/sdcard/deep"},
         {"/data", "/data/blocker/run", -1, "/data/blocker/run"},
         {"/mnt/sdcard", "/mnt/sdcard/qrvlog/next/APLog_1/", -1, "/data/elsewhere/APLog_1"},
+        // A link planted where the daemon's own folders belong goes, not what it points to.
+        {"/mnt/sdcard", "/mnt/sdcard/qrvlog/tavlolog/APLog_2/", 1, "/mnt/sdcard/qrvlog/tavlolog/APLog_2"},
+        {"/mnt/sdcard/other/", "/mnt/sdcard/other/qrvlog/tavlolog/APLog_3", 1, "/mnt/sdcard/other/qrvlog/tavlolog"},
         {"/data", too_long.c_str(), -1, too_long_part.c_str()},  // 255 characters: no room for '/' 
     };
     for (const auto& c : cases) {
@@ -80,6 +85,8 @@ TEST(CreateRunFolder, CreatesEveryMissingFolderWithGroupAccessOrRefuses) {
         EXPECT_EQ(mode_of(c.check), c.result == 1 ? 0770u : 0u) << c.check;
     }
     EXPECT_EQ(mode_of("/mnt/sdcard/deep/a/b/c"), 0770u);
+    EXPECT_TRUE(exists("/data/elsewhere") && files_in("/data/elsewhere").empty());
+    EXPECT_TRUE(history_has("/mnt/sdcard/qrvlog/tavlolog is a symbolic link, removed"));
 }
 
 // The run's folder is named after its start time; a log path that leaves no
@@ -103,6 +110,51 @@ TEST(RunFolder, NamedAfterTheStartTimeAndPublished) {
     EXPECT_EQ(property(PROP_REALPATH), "/mnt/sdcard/qrvlog/tavlolog/APLog_2026_0304_070649/");
     publish_run_folder(&controller, ("/mnt/" + std::string(90, 'd') + "/qrvlog/tavlolog/APLog_2026_0304_070650/").c_str());
     EXPECT_EQ(property(PROP_REALPATH), "") << "the earlier run's folder would receive this run's records";
+}
+
+// The first daemon of a boot keeps aside what the boot before held and never
+// copied, while /data keeps the holding folder's room; a stray where the
+// folder belongs goes; a folder that cannot be made leaves the boot copy
+// nothing to wait for unless a previous boot's logs are held.
+TEST(StartInTempFolder, KeepsThePreviousBootsHeldLogsAside) {
+    SKIP_OUTSIDE_PHONE();
+    const std::string held_before = "mkdir /data/log_temp_prev /data/log_temp && touch /data/log_temp_prev/old /data/log_temp/kernel_log";
+    const std::string no_inode = "mkdir -p /data/misc/tqlog && touch " + std::string(kHistory) + " && while touch /data/f$((i=i+1)); do :; done";
+    const struct {
+        const char* mount;  // options of the tmpfs /data
+        const char* booted;
+        std::string setup;
+        int result;
+        const char *temp, *prev;  // their files afterwards, "-": no folder
+        uint8_t timer;
+        const char* record;
+    } cases[] = {
+        {"size=200m", "0", held_before, 1, "", "kernel_log", 1, "held logs of the previous boot kept in /data/log_temp_prev/"},
+        {"size=20m", "0", held_before, 1, "", "-", 1, "held logs of the previous boot dropped, /data has "},
+        {"size=200m", "0", "mkdir /data/log_temp && touch /data/log_temp/.x", 1, "", "-", 1, ""},
+        {"size=200m", "0", "echo x > /data/log_temp", 1, "", "-", 1, "/data/log_temp is not a folder, will delete it"},
+        {"size=200m", "1", "ln -s /nowhere /data/log_temp", 1, "", "-", 1, "/data/log_temp is not a folder, will delete it"},
+        {"size=200m,nr_inodes=16", "0", no_inode, 0, "-", "-", 0, "mkdir /data/log_temp/ faild,errno=28"},
+        {"size=200m,nr_inodes=16", "0", "mkdir /data/log_temp && touch /data/log_temp/kernel_log && " + no_inode, 0, "-", "kernel_log", 1, ""},
+    };
+    auto files = [](const std::string& dir) {
+        std::string names = exists(dir) ? "" : "-";
+        for (const std::string& name : files_in(dir)) names += (names.empty() ? "" : " ") + name;
+        return names;
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.setup);
+        ASSERT_EQ(0, system(("umount /data 2>/dev/null; mount -t tmpfs -o " + std::string(c.mount) + " tmpfs /data && " + c.setup + " 2>/dev/null; true").c_str()));
+        property_set(PROP_BOOTED, c.booted);
+        LogController controller;
+        controller.boot_mode = 0;
+        EXPECT_EQ(c.result, start_in_temp_folder(&controller));
+        EXPECT_EQ(c.temp, files("/data/log_temp"));
+        EXPECT_EQ(c.prev, files("/data/log_temp_prev"));
+        EXPECT_EQ(c.timer, controller.boot_copy_timer);
+        EXPECT_TRUE(history_has(c.record)) << c.record;
+    }
+    system("umount /data");
 }
 
 TEST(SignalChild, NeverSignalsTheDaemonsOwnGroup) {
@@ -204,6 +256,17 @@ TEST_F(RunTest, StopKeepsEverythingTheCollectorSent) {
     std::string body = read_file("/data/run_test/kernel_log");
     EXPECT_TRUE(body == "-----timezone: GMT\n" + sent) << body.size() << " of " << sent.size() << " bytes";
     EXPECT_NE(kill(collector, 0), 0) << "the stop left a collector behind";
+}
+
+// A collector that died just before the stop, its notice not handled yet.
+TEST_F(RunTest, StopRecordsACollectorThatDiedJustBefore) {
+    start_logging(&controller_);
+    pid_t collector = controller_.klog_pid;
+    ASSERT_EQ(kill(collector, SIGKILL), 0);
+    siginfo_t info;
+    ASSERT_EQ(waitid(P_PID, collector, &info, WEXITED | WNOWAIT), 0);  // dead, not reaped
+    stop_logging(&controller_);
+    EXPECT_TRUE(has_record(" pid " + std::to_string(collector) + " send sig_chld "));
 }
 
 std::string fd_target(pid_t pid, int fd) {

@@ -128,6 +128,10 @@ TEST(UpdateFolderRecords, RecordsTheNewFolderLastWithinTheBudget) {
         for (const std::string& record : c.records) EXPECT_TRUE(has_record(record)) << record;
         for (const auto& folder : c.on_card) EXPECT_TRUE(exists(kParent + folder.first));
     }
+    // A parent that cannot be opened: the record says which.
+    ASSERT_EQ(0, system("rm -rf /mnt/sdcard/qrvlog"));
+    EXPECT_EQ(0, update_folder_records("/mnt/sdcard", (kParent + "D/").c_str(), 1, 600, 300));
+    EXPECT_TRUE(has_record("open " + kParent + " fail No such file or directory"));
 }
 
 using Files = std::map<std::string, std::string>;
@@ -154,10 +158,13 @@ TEST(CopyLogFolder, AppendsOldestPieceFirstAndKeepsWhatCannotGo) {
          {{"kernel_log.boot", "old" + N + "k3" + N + "k1" + N + "k0"}}, {}, COPY_DONE},
         {{}, 1, 0, 0, 1, RLIM_INFINITY,
          {{"kernel_log.boot", "old" + std::string("TavloLog in Low Nand Storage, some or all boot(hbr) logs are NOT saved!!!\n")}}, {}, COPY_DONE},
-        // Switched-off types and pieces beyond the fourth keep their names; dot files stay.
+        // Pieces beyond the fourth keep their names, a switched-off type's never the run's; dot files stay.
         {{{"bt_log", "b"}, {"main_log.5", "m5"}, {".x", "x"}}, 0, 1, 0, 0, RLIM_INFINITY,
          {{"kernel_log.boot", "old"}, {"main_log.boot", N}, {"events_log.boot", N}, {"radio_log.boot", N},
-          {"bt_log", N + "b"}, {"main_log.5", N + "m5"}}, {".x"}, COPY_DONE},
+          {"bt_log.boot", N + "b"}, {"main_log.5", N + "m5"}}, {".x"}, COPY_DONE},
+        // A piece that cannot be read stays; the newer ones still go to the suffixed file, none to the run's own.
+        {{{"kernel_log.3", "k3"}, {"kernel_log.2/", ""}, {"kernel_log", "k0"}}, 1, 0, 0, 0, RLIM_INFINITY,
+         {{"kernel_log.boot", "old" + N + "k3" + N + "k0"}}, {"kernel_log.2"}, COPY_DONE},
         // A folder among the held files cannot be read: it stays, the card gets nothing of it.
         {{{"bt_log/", ""}, {"kernel_log", "k0"}}, 1, 0, 0, 0, RLIM_INFINITY,
          {{"kernel_log.boot", "old" + N + "k0"}}, {"bt_log"}, COPY_DONE},
@@ -165,13 +172,13 @@ TEST(CopyLogFolder, AppendsOldestPieceFirstAndKeepsWhatCannotGo) {
         {{{"kernel_log.2", "k2"}, {"kernel_log", std::string(9000, 'k')}}, 1, 0, 0, 0, 4096,
          {{"kernel_log.boot", "old" + N + "k2"}}, {"kernel_log"}, COPY_ABORT},
     };
+    LogController controller;
+    strcpy(controller.logpath, "/mnt/sdcard");
     for (const auto& c : cases) {
         SCOPED_TRACE(c.copied.begin()->second.substr(0, 40));
         ASSERT_EQ(0, system(("rm -rf " + kHeld + " " + kRun + "; mkdir -p " + kHeld + " " + kRun).c_str()));
         for (const auto& f : c.held) f.first.back() == '/' ? (void)mkdir((kHeld + f.first).c_str(), 0700) : write_file(kHeld + f.first, f.second);
         write_file(kRun + "kernel_log.boot", "old");
-        LogController controller;
-        strcpy(controller.logpath, "/mnt/sdcard");
         controller.kernel_log = c.kernel;
         controller.android_log = c.android;
         controller.bt_log = c.bt;
@@ -186,6 +193,12 @@ TEST(CopyLogFolder, AppendsOldestPieceFirstAndKeepsWhatCannotGo) {
         EXPECT_EQ(c.kept, files_in(kHeld));
         for (const std::string& name : c.kept) EXPECT_EQ(c.held.count(name) ? c.held.at(name) : "", read_file(kHeld + name));
     }
+    // The suffixed file cannot be opened: the held log stays, and goes to no file of the run instead.
+    ASSERT_EQ(0, system(("rm -rf " + kHeld + "* " + kRun + "*; mkdir " + kRun + "kernel_log.boot").c_str()));
+    write_file(kHeld + "kernel_log", "k0");
+    copy_log_folder(&controller, kHeld.c_str(), kRun.c_str(), ".boot");
+    EXPECT_EQ(Lines{"kernel_log.boot"}, files_in(kRun));
+    EXPECT_EQ(Lines{"kernel_log"}, files_in(kHeld));
 }
 
 const std::string kFooter = "================ END of FILE ===============\n\n";

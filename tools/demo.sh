@@ -24,8 +24,10 @@ echo "== Writing logs on the phone while it boots"
 $emu exec "$phone" log -t demo "hello from the boot"
 $emu exec "$phone" log -b radio -t demo_radio "a line on the radio buffer"
 $emu exec "$phone" log -b events -t 1000003 i:3 s:demo
+# Kernel lines carry the time since boot, as the kernel writes them.
+uptime() { awk '{printf "%12.6f", $1}' /proc/uptime; }
 for i in 1 2 3; do
-    echo "<6>[demo] boot-time kernel line $i" > "$phone/.emu/kmsg"
+    echo "<6>[$(uptime)] boot-time kernel line $i" > "$phone/.emu/kmsg"
 done
 printf 'bluetooth stack log line from the boot\n' > "$phone/.emu/btlog"
 sleep 2
@@ -38,7 +40,7 @@ echo
 echo "== A client asks for the copy to the card"
 $emu exec "$phone" tavlologctl copy
 $emu exec "$phone" log -t demo "a line after the copy"
-echo "<6>[demo] kernel line after the copy" > "$phone/.emu/kmsg"
+echo "<6>[$(uptime)] kernel line after the copy" > "$phone/.emu/kmsg"
 # The reply comes first; the held logs and the device's state follow.
 for _ in $(seq 100); do
     grep -qs "<< system properties >>" "$phone"/sdcard/qrvlog/tavlolog/APLog_*/properties && break
@@ -72,3 +74,12 @@ cat "$phone/data/misc/tqlog/tqlog_history"
 echo
 echo "== Configuration: $phone/data/misc/tqlog/tqlog_config"
 cat "$phone/data/misc/tqlog/tqlog_config"
+
+echo
+echo "== The run as one timeline: build/tools/tavlolog/tavlolog $run"
+echo "   (the held boot first; K kernel, M main and system, R radio, E events, B Bluetooth)"
+build/tools/tavlolog/tavlolog --no-pager "$run"
+report=$PWD/tavlolog-report.html
+build/tools/tavlolog/tavlolog --html "$report" "$run" 2>/dev/null
+echo
+echo "== The HTML report of the run: $report"

@@ -16,7 +16,8 @@ sudo=""
 [ "$(id -u)" -eq 0 ] || sudo="sudo"
 
 pkgs=(build-essential cmake ninja-build pkg-config bubblewrap util-linux procps
-      libgtest-dev libgmock-dev android-liblog-dev android-libcutils-dev libfuse3-dev fuse3)
+      libgtest-dev libgmock-dev android-liblog-dev android-libcutils-dev libfuse3-dev fuse3
+      chromium tzdata less)
 if [ $arm = 1 ]; then
     # Not crossbuild-essential-armhf: it would upgrade the host's perl.
     pkgs+=(g++-arm-linux-gnueabihf qemu-user-static

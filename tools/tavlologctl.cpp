@@ -117,6 +117,24 @@ static int run_raw(const char* text, int timeout_ms) {
     return exit_for_reply(answer);
 }
 
+// "main=up,radio=up,..." as "collectors: main up, radio up, ..."; "none"
+// while no run is active.
+static void print_collectors() {
+    char value[PROPERTY_VALUE_MAX];
+    property_get(PROP_COLLECTORS, value, "");
+    printf("collectors: %s", value[0] ? "" : "none");
+    for (const char* c = value; *c; c++) {
+        if (*c == '=') {
+            putchar(' ');
+        } else if (*c == ',') {
+            fputs(", ", stdout);
+        } else {
+            putchar(*c);
+        }
+    }
+    putchar('\n');
+}
+
 static int run_status() {
     char running[PROPERTY_VALUE_MAX];
     char folder[PROPERTY_VALUE_MAX];
@@ -140,6 +158,7 @@ static int run_status() {
     } else {
         printf("per-pid budget (%s): off, every entry kept\n", PROP_PID_BUDGET);
     }
+    print_collectors();
     return EXIT_DONE;
 }
 

@@ -228,11 +228,8 @@ static void discard_leftovers() {
     node_pool_trim(0);
 }
 
-// The server socket is made here, before the collectors are forked, so that
-// their first connection succeeds and every child knows the descriptor it
-// inherits (transist_listen_fd) and must close.
-static void open_listen_socket() {
-    if (transist_listen_fd >= 0) return;  // still served from a run whose reader failed early
+int transist_listen() {
+    if (transist_listen_fd >= 0) return 1;
     int fd = socket_local_server(LOG_SOCKET_NAME, ANDROID_SOCKET_NAMESPACE_ABSTRACT, SOCK_STREAM);
     if (fd < 0) {
         int err = errno;
@@ -241,17 +238,18 @@ static void open_listen_socket() {
         if (err == EADDRINUSE) {
             HLOG(TAG_TRANSIST, WLOG_ERROR, "log_socket is held by another process");
         }
-        return;
+        return 0;
     }
     fcntl(fd, F_SETFD, FD_CLOEXEC);
     if (listen(fd, 10) < 0) {
         HLOG(TAG_TRANSIST, WLOG_ERROR, "listen reader socket failed");
         close(fd);
-        return;
+        return 0;
     }
     // Accepting must never block the reader: the backlog is also emptied at stop.
     fcntl(fd, F_SETFL, fcntl(fd, F_GETFL) | O_NONBLOCK);
     transist_listen_fd = fd;
+    return 1;
 }
 
 void transist_create(LogController* controller, const char* run_folder, int rotate_kb) {
@@ -277,7 +275,8 @@ void transist_create(LogController* controller, const char* run_folder, int rota
     for (LogFile& entry : log_files) entry.sock = -1;
     pthread_mutex_unlock(&file_table_lock);
 
-    open_listen_socket();
+    // Held already when the daemon could bind it at start; else tried again.
+    transist_listen();
 
     int read_err = pthread_create(&read_thread_id, nullptr, read_thread, nullptr);
     if (read_err != 0) {

@@ -26,10 +26,17 @@ extern std::atomic<bool> stop_requested;
 
 // Process-wide table of output files, one entry per log type (file-table lock).
 extern LogFile log_files[LOG_TYPE_COUNT];
-// Listening socket of "log_socket", -1 when none. Collectors close their inherited copy.
+// Listening socket of "log_socket", -1 when none. Kept from the first bind to
+// the end of the process; collectors close their inherited copy.
 extern int transist_listen_fd;
 extern pthread_t read_thread_id;
 extern pthread_t write_thread_id;
+
+// Binds and listens on "log_socket" unless that is done already. An abstract
+// name has no permissions: whoever binds it first serves it, so the daemon
+// binds it once as it starts, before any app runs, and keeps it for all its
+// runs. Returns 1 when it is served, 0 (recorded) when it cannot be.
+int transist_listen();
 
 // Starts the transist of a run: discards leftovers, opens the output files,
 // starts the reader and writer threads.

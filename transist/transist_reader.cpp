@@ -450,9 +450,9 @@ void* read_thread(void*) {
         flush_ms = peer_records_flush();
     }
 
+    // The listening socket stays for the next run: freed, its name could be
+    // taken by any app in between.
     drain_at_stop();
-    close(transist_listen_fd);
-    transist_listen_fd = -1;
     WLOG(TAG_TRANSIST, WLOG_DEBUG, "read_thread exits");
     mark_reader_done();
     return reinterpret_cast<void*>(1);

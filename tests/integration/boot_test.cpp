@@ -18,10 +18,15 @@ SCENARIOS(Boot, {
       {"has", "/data/misc/tqlog/inter_sd_folder", "APLog_"}}},
     {"DataPathRecordsOnData", {{kOn.first, kOn.second + "qrvlog_path=/data\n"}}, {},
      {{"hist", "mkdir /data/qrvlog/tavlolog/APLog_"}, {"hist", " M("}}},
-    // init restarts a crashed daemon within the boot: what it held stays.
-    {"RestartKeepsTheHeldLogs", {kOn}, {},
+    // init restarts a crashed daemon within the boot: what it held stays; a
+    // boot that ends before any copy has its held logs brought by the next one.
+    {"RestartOrRebootBeforeACopyKeepsTheHeldLogs", {kOn}, {},
      {{"kmsg", "before the crash\n"}, {"has", "/data/log_temp/kernel_log", "before the crash"}, {"crash"},
-      {"kmsg", "after\n"}, {"has", "/data/log_temp/kernel_log", "before the crash\n" + H + "after\n"}}},
+      {"kmsg", "after\n"}, {"has", "/data/log_temp/kernel_log", "before the crash\n" + H + "after\n"},
+      {"boot", "0"}, {"hist", "held logs of the previous boot kept in /data/log_temp_prev/"},
+      {"kmsg", "next boot\n"}, {"has", "/data/log_temp/kernel_log", "next boot"}, {"ctl", "copy"},
+      {"is", "$RUN/kernel_log.prev_boot", N + H + "before the crash\n" + H + "after\n"},
+      {"has", "$RUN/kernel_log.boot", N + H + "next boot\n"}, {"gone", "/data/log_temp_prev"}}},
     {"LowDataStartsNoRun", {kOn}, {"--data-size", "8"},
      {{"hist", "/data is low, dont start children process(2)"}, {"ctl", "stop"}, {"gone", "/data/log_temp"},
       {"hist", " M(", "0"}}},
@@ -38,16 +43,21 @@ SCENARIOS(Boot, {
       {"has", "$RUN/kernel_log.boot", "second boot"}, {"gone", "/data/log_hbr"},
       // A power-off that was not followed through: logging ends at boot too.
       {"ctl", "deep_stop"}, {"prop", "debug.TQ.running", "0"}, {"has", kConfig, "autostart=0\n"}}},
-    {"OtherBootsKeepTwoEarlierAndComeInOrder", {kOn}, {"--boot-mode", "7"},
-     {{"boot", "none"}, {"boot", "7"}, {"boot", "9"}, {"kmsg", "other 4\n"},
-      {"has", "/data/log_other_mode/4/kernel_log", "other 4"}, {"boot", "7"}, {"kmsg", "other 5\n"},
-      {"has", "/data/log_other_mode/5/kernel_log", "other 5"}, {"boot", "7"}, {"kmsg", "other 6\n"},
-      {"has", "/data/log_other_mode/6/kernel_log", "other 6"}, {"gone", "/data/log_other_mode/3"},
+    // A stray file gives way to the folders; every number up to the newest
+    // two is removed (4 was made by hand), restarts within a boot go on in its folder.
+    {"OtherBootsKeepTwoEarlierAndComeInOrder", {kOn, {"/data/log_other_mode", "stray"}}, {"--boot-mode", "7"},
+     {{"hist", "/data/log_other_mode is not a folder, will delete it"}, {"sh", "mkdir /data/log_other_mode/4"},
+      {"boot", "none"}, {"kmsg", "other 5\n"}, {"has", "/data/log_other_mode/5/kernel_log", "other 5"},
+      {"boot", "9"}, {"kmsg", "other 6\n"}, {"has", "/data/log_other_mode/6/kernel_log", "other 6"},
+      {"boot", "7"}, {"kmsg", "other 7\n"}, {"has", "/data/log_other_mode/7/kernel_log", "other 7"},
+      {"crash"}, {"crash"}, {"kmsg", "restarted\n"}, {"has", "/data/log_other_mode/7/kernel_log", "restarted"},
+      {"sh", "grep -o 'rm -r .*' /data/misc/tqlog/tqlog_history",
+       "rm -r /data/log_other_mode/1\nrm -r /data/log_other_mode/2\nrm -r /data/log_other_mode/4\n"},
       {"boot", "0"}, {"ctl", "stop start"},
-      {"has", "$RUN/kernel_log.otherboot", "other 4\n" + N + H + "other 5\n" + N + H + "other 6\n"},
+      {"has", "$RUN/kernel_log.otherboot", "other 5\n" + N + H + "other 6\n" + N + H + "other 7\n" + H + H + "restarted\n"},
       {"has", "$RUN/kernel_log.boot", N + H}, {"gone", "/data/log_other_mode"}, {"gone", "/data/log_temp"}}},
     // A restart would fail the same way: the daemon serves without a run instead.
-    {"OtherBootFolderThatCannotBeMadeLeavesNoRun", {kOn, {"/data/log_other_mode", "no folder"}}, {"--boot-mode", "7"},
+    {"OtherBootFolderThatCannotBeMadeLeavesNoRun", {kOn, {"/data/log_other_mode/.keep", ""}}, {"--boot-mode", "7"},
      {{"hist", "mkdir /data/log_other_mode/1/ failed"}, {"ctl", "start"}}},
     {"KelmBootCardAfterAPlainFolder", {}, {"--boot-mode", "1", "--ext-sdcard", "dir after 3 link"},
      {{"hist", "/data/ext_sdcard_tool is not a link, will delete it"}, {"hist", "SDcard mounted! kelm copy!"},

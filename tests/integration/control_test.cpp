@@ -7,6 +7,10 @@ namespace {
 
 const std::string H = kFileHeader;
 const std::string kAsUid = "setpriv --reuid=$u --regid=$u --clear-groups tavlologctl ";
+// An app binding the collectors' socket name: "bound" when it got it.
+const std::string kSquatLogSocket =
+    "setpriv --reuid=10050 --regid=10050 --clear-groups perl -MSocket -e 'socket(S, PF_UNIX, SOCK_STREAM, 0) or die;"
+    " print bind(S, pack_sockaddr_un(\"\\0log_socket\")) ? \"bound\\n\" : \"refused\\n\"'";
 
 std::vector<Step> ten_clients() {
     std::vector<Step> steps;
@@ -58,6 +62,11 @@ SCENARIOS(Control, {
                             {"ctl", "start"}, {"alive", "c0"}, {"alive", "c9"}});
          return s;
      }()},
+    // The daemon holds "log_socket" from its start to its end, runs or not.
+    {"AnAppCannotTakeTheCollectorsSocket", {}, {},
+     {{"sh", kSquatLogSocket, "refused\n"}, {"ctl", "AndroidLog=0 BTLog=0 start stop"},
+      {"sh", kSquatLogSocket, "refused\n"}, {"ctl", "start"}, {"kmsg", "recorded\n"},
+      {"has", "$RUN/kernel_log", "recorded\n"}}},
     // Refusals are recorded within a limit: the first, then a summary.
     {"OnlyPrivilegedUsersAreServed", {}, {},
      {{"sh", "for u in 12345 10000 9999 1000 2000 0; do " + kAsUid + "logsize=300; echo $?; done",

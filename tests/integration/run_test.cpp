@@ -48,6 +48,17 @@ SCENARIOS(Run, {
       {"alive", "starter"}, {"alive", "bystander"}, {"ctl", "start"}, {"kmsg", "after the death\n"},
       {"has", "$RUN/kernel_log", "after the death\n"}, {"sh", kill_kernel_collector("USR1")},
       {"hist", "oru warning comes,type is 0\n"}, {"hist", "all chil processes die", "2"}}},
+    // One collector killed from outside: the run goes on without it, and the
+    // status shows it down within a second.
+    {"OneCollectorsDeathShowsInTheStatus", {}, {},
+     {{"ctl", "start"}, {"prop", "debug.TQ.collectors", "main=up,radio=up,events=up,kernel=up,bt=up"},
+      {"sh", std::string("kill -9 $(grep -o 'M([0-9]*)' ") + kHistory + " | tail -n 1 | tr -dc 0-9); " +
+                 "for i in $(seq 20); do getprop debug.TQ.collectors | grep -q main=down && break; sleep 0.05; done; " +
+                 "tavlologctl status | grep collectors",
+       "collectors: main down, radio up, events up, kernel up, bt up\n"},
+      {"hist", "mLog dies unexpectly", "1"}, {"prop", "debug.TQ.running", "1"}, {"kmsg", "still recorded\n"},
+      {"has", "$RUN/kernel_log", "still recorded"}, {"ctl", "stop"},
+      {"sh", "tavlologctl status | grep collectors", "collectors: none\n"}}},
     // Five megabytes take the 14 MB card below its 10 MiB reserve.
     {"LowCardStopsTheRunAndTellsEveryClient", {}, {"--sdcard-size", "14"},
      {{"ctl", "AndroidLog=0 BTLog=0"}, {"listen", "starter", "start"}, {"listen", "bystander"},

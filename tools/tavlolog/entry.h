@@ -39,6 +39,16 @@ struct Entry {
     uint64_t offset;        // byte offset of the line in that file
     int boot;               // boot section: 0 the run itself, -1 the held boot before it, -2 ...
     std::string_view boot_name;  // the held piece's suffix ("boot", "hbr", ...), empty for the run
+    // A marker, note or malformed line has no instant of its own: it takes that
+    // of the line before it in its file, so that it stays in place.
+    bool inherited = false;
+    int64_t uptime_ns = -1;      // a kernel line's own time since boot, -1 when it has none
+    std::string_view run;        // the run folder's name
 };
+
+// "emerg" .. "verbose", or "" for PRIO_NONE.
+const char* priority_name(int priority);
+// The Android letter of a priority (F E W I D V), '-' for none.
+char priority_letter(int priority);
 
 }  // namespace tavlolog
