@@ -17,6 +17,9 @@ const char* KmsgCat::kmsg_path = "/proc/kmsg";
 
 // One read of at most this many bytes per chunk; the transist reassembles them.
 constexpr int KMSG_CHUNK = 255;
+// What several reads returned goes out in one send, up to this many bytes
+// (within one read of the transist's).
+constexpr size_t KMSG_BATCH = 16 * KMSG_CHUNK;
 // After data, wait this long for more before going back to an unbounded wait.
 constexpr int KMSG_QUIET_SECONDS = 3;
 
@@ -45,15 +48,38 @@ void KmsgCat::run(const char*, int block_fd) {
     forward(kmsg_fd);
 }
 
+// Reads what /proc/kmsg has ready, in reads of at most KMSG_CHUNK bytes, into
+// buf (room for KMSG_BATCH): a busy kernel log then costs one send per batch
+// instead of one per read. Returns the bytes read; on a first read that
+// failed or found nothing, logs it and returns 0.
+static size_t read_ready(int kmsg_fd, char* buf) {
+    size_t got = 0;
+    while (got + KMSG_CHUNK <= KMSG_BATCH) {
+        memset(buf + got, 0, KMSG_CHUNK);
+        ssize_t n = read(kmsg_fd, buf + got, KMSG_CHUNK);
+        if (n > 0) got += static_cast<size_t>(n);
+        // A short read took everything there was.
+        if (n > 0 && n < KMSG_CHUNK) break;
+        if (n > 0) continue;
+        if (got > 0) break;
+        if (n < 0) {
+            WLOG(TAG_KERNEL, WLOG_DEBUG, "Maybe others read kmsg, ignore.(%s)", strerror(errno));
+        } else {
+            WLOG(TAG_KERNEL, WLOG_DEBUG, "read: Unexpected EOF! Maybe others read kmsg, ingore.\n");
+        }
+        break;
+    }
+    return got;
+}
+
 void KmsgCat::forward(int kmsg_fd) {
     sigset_t wait_mask;
     hold_stop_signal(&wait_mask);
 
-    char buf[KMSG_CHUNK + 1];
+    char buf[KMSG_BATCH + 1];
     bool wait_forever = true;
     for (;;) {
         check_stop(this);
-        memset(buf, 0, KMSG_CHUNK);
 
         fd_set readable;
         int ready;
@@ -71,17 +97,9 @@ void KmsgCat::forward(int kmsg_fd) {
         }
 
         if (ready > 0 && FD_ISSET(kmsg_fd, &readable)) {
-            ssize_t n = read(kmsg_fd, buf, KMSG_CHUNK);
-            if (n < 0) {
-                WLOG(TAG_KERNEL, WLOG_DEBUG, "Maybe others read kmsg, ignore.(%s)", strerror(errno));
-                continue;
-            }
-            if (n == 0) {
-                WLOG(TAG_KERNEL, WLOG_DEBUG,
-                     "read: Unexpected EOF! Maybe others read kmsg, ingore.\n");
-                continue;
-            }
-            if (send_to_transist(buf, static_cast<size_t>(n), transist_fd) == -1) {
+            size_t n = read_ready(kmsg_fd, buf);
+            if (n == 0) continue;
+            if (send_to_transist(buf, n, transist_fd) == -1) {
                 int err = errno;
                 HLOG(TAG_KERNEL, WLOG_ERROR, "write fails: %s, errno = %d", strerror(err), err);
                 return;

@@ -19,6 +19,7 @@
 #include "common/io_util.h"
 #include "common/limits.h"
 #include "record/record.h"
+#include "platform/properties.h"
 
 const char* LogCat::device_root = "/dev/log/";
 
@@ -26,6 +27,8 @@ const char* LogCat::device_root = "/dev/log/";
 // merged before they go out.
 constexpr long BATCH_NS = 5 * 1000 * 1000;
 constexpr int PRIORITY_WARN = 5;
+constexpr int READS_PER_PASS = 64;
+constexpr int SINGLE_READ_PASSES = 8;
 
 // One read buffer for the process: a read hands over one whole entry, which
 // is then copied into a block of its own size.
@@ -89,10 +92,42 @@ int LogCat::set_output_format() {
 void LogCat::queue(LogDevice* device, QueuedEntry* entry) {
     enqueue_entry(device, entry);
     queued_count++;
-    if (queued_count > OVERLOAD_THRESHOLD) overloaded = true;
+    queued_bytes += queued_entry_size(entry);
+    if (queued_count > OVERLOAD_THRESHOLD || queued_bytes > OVERLOAD_BYTES) overloaded = true;
+}
+
+static int64_t monotonic_now_us() {
+    struct timespec ts;
+    clock_gettime(CLOCK_MONOTONIC, &ts);
+    return static_cast<int64_t>(ts.tv_sec) * 1000000 + ts.tv_nsec / 1000;
+}
+
+// The writer and tag of legacy entry bytes, for the flood budget: a text
+// entry's tag follows its priority byte; an event's is its number.
+static bool entry_writer(const LogDevice* device, const char* raw, size_t n, int32_t* pid, char* tag) {
+    if (n < LEGACY_HEADER_SIZE + 4) return false;
+    uint32_t value;
+    memcpy(&value, raw + 4, sizeof(value));  // little-endian, as the device
+    *pid = static_cast<int32_t>(value);
+    if (device->binary) {
+        memcpy(&value, raw + LEGACY_HEADER_SIZE, sizeof(value));
+        snprintf(tag, FLOOD_TAG_LEN, "%u", value);
+        return true;
+    }
+    const char* text = raw + LEGACY_HEADER_SIZE + 1;
+    size_t len = strnlen(text, n - LEGACY_HEADER_SIZE - 1);
+    if (len >= FLOOD_TAG_LEN) len = FLOOD_TAG_LEN - 1;
+    memcpy(tag, text, len);
+    tag[len] = '\0';
+    return true;
 }
 
 int LogCat::take_entry(LogDevice* device, const char* raw, size_t n) {
+    if (flood.budget() != 0) {
+        int32_t pid;
+        char tag[FLOOD_TAG_LEN];
+        if (entry_writer(device, raw, n, &pid, tag) && !flood.admit(pid, tag, n, monotonic_now_us())) return 0;
+    }
     QueuedEntry* entry = adapt_legacy_entry(raw, n, device->log_id);
     if (entry == nullptr) {
         // Once per process: a device that keeps handing out such bytes must
@@ -144,9 +179,13 @@ void LogCat::print_start_marker(LogDevice* device) {
 }
 
 void LogCat::format_and_send(const AndroidLogEntry& line) {
-    char buf[512];
+    // Rendered straight into the batch when it fits in 512 bytes, as nearly
+    // every line does: one copy less per line.
+    const size_t room = 512;
+    if (sizeof(output) - output_len < room) flush_output();
+    char* buf = output + output_len;
     size_t len = 0;
-    char* text = android_log_formatLogLine(format, buf, sizeof(buf), &line, &len);
+    char* text = android_log_formatLogLine(format, buf, room, &line, &len);
     if (text == nullptr) {
         // The lines rendered before this one are whole: they still go out
         // (a failed send records "output error" and ends there).
@@ -154,17 +193,22 @@ void LogCat::format_and_send(const AndroidLogEntry& line) {
         HLOG(TAG_ANDROID, WLOG_ERROR, "output error");
         exit_collector(this, 1, REASON_OUTPUT);
     }
+    if (text == buf) {
+        output_len += len;
+        return;
+    }
     append_output(text, len);
-    if (text != buf) free(text);
+    free(text);
 }
 
 void LogCat::drop_next_entry(LogDevice* device) {
     print_start_marker(device);
     QueuedEntry* entry = dequeue_oldest(device);
     if (entry == nullptr) return;
+    queued_bytes -= queued_entry_size(entry);
     free_queued_entry(entry);
     queued_count--;
-    if (queued_count <= OVERLOAD_THRESHOLD) {
+    if (queued_count <= OVERLOAD_THRESHOLD && queued_bytes <= OVERLOAD_BYTES) {
         overloaded = false;
         marker_queued = false;
     }
@@ -206,6 +250,29 @@ void LogCat::print_next_entry(LogDevice* device) {
     drop_next_entry(device);
 }
 
+void LogCat::report_drops(bool all) {
+    if (flood.budget() == 0) return;
+    FloodDrops drops;
+    int64_t now_us = monotonic_now_us();
+    while (all ? flood.next_summary_now(&drops) : flood.next_summary(now_us, &drops)) {
+        char message[192];
+        snprintf(message, sizeof(message),
+                 "dropped %ld entries (%ld bytes) of pid %d tag %s: past its budget of %ld KB/s", drops.entries,
+                 drops.bytes, static_cast<int>(drops.pid), drops.tag, flood.budget() / 1024);
+        struct timeval now;
+        gettimeofday(&now, nullptr);
+        AndroidLogEntry line = {};
+        line.tv_sec = now.tv_sec;
+        line.tv_nsec = now.tv_usec * 1000L;
+        line.priority = ANDROID_LOG_WARN;
+        line.tag = "TavloLogD";
+        line.tagLen = strlen(line.tag);
+        line.message = message;
+        line.messageLen = strlen(message);
+        format_and_send(line);
+    }
+}
+
 void LogCat::push_marker_entry(LogDevice* device) {
     struct timeval now;
     gettimeofday(&now, nullptr);
@@ -244,6 +311,8 @@ void LogCat::print_all() {
 
 void LogCat::finish(int status, int reason) {
     print_all();
+    report_drops(true);
+    flush_output();
     exit_collector(this, status, reason);
 }
 
@@ -285,7 +354,14 @@ void LogCat::read_log_lines() {
     defer_stop_signal = true;
 
     int maxfd = -1;
-    for (LogDevice* d = devices; d != nullptr; d = d->next) maxfd = d->fd > maxfd ? d->fd : maxfd;
+    for (LogDevice* d = devices; d != nullptr; d = d->next) {
+        maxfd = d->fd > maxfd ? d->fd : maxfd;
+        // A device with a backlog is read until it has nothing more, up to
+        // READS_PER_PASS entries: a wait per entry would cost a busy log (or
+        // a flood) more than reading it. One that had none is read an entry
+        // a pass for a while: the read finding nothing would cost as much.
+        fcntl(d->fd, F_SETFL, fcntl(d->fd, F_GETFL) | O_NONBLOCK);
+    }
     bool wait_forever = false;
     for (;;) {
         if (stop_signalled) finish_at_stop(REASON_SIGNAL);
@@ -300,8 +376,12 @@ void LogCat::read_log_lines() {
             // remainder a timed-out select leaves, later waits would return
             // at once and the collector would spin.
             struct timespec batch = {0, BATCH_NS};
-            ready = pselect(maxfd + 1, &readable, nullptr, nullptr, wait_forever ? nullptr : &batch,
-                            &wait_mask);
+            // Drops of a flood are told once a second, also when the flood
+            // has stopped: the only clock this loop keeps while nothing flows.
+            int due_ms = flood.budget() != 0 ? flood.summary_due_ms(monotonic_now_us()) : -1;
+            struct timespec summary = {due_ms / 1000, (due_ms % 1000) * 1000000L};
+            struct timespec* wait = wait_forever ? (due_ms >= 0 ? &summary : nullptr) : &batch;
+            ready = pselect(maxfd + 1, &readable, nullptr, nullptr, wait, &wait_mask);
         } while (ready < 0 && errno == EINTR && !stop_signalled);
         if (ready < 0) {
             if (errno != EINTR) back_off_after_failed_wait(this, errno, &wait_mask);
@@ -311,15 +391,24 @@ void LogCat::read_log_lines() {
         if (ready == 0) {
             // Quiet for the batching time: nothing older can still come.
             print_all();
+            report_drops(false);
+            flush_output();
+            trim_entry_pool(ENTRY_POOL_QUIET);
             wait_forever = true;
             continue;
         }
         bool interrupted = false;
         for (LogDevice* d = devices; d != nullptr && !interrupted; d = d->next) {
-            if (FD_ISSET(d->fd, &readable) && read_entry(d, &interrupted) == 0) break;
+            if (!FD_ISSET(d->fd, &readable)) continue;
+            int max_reads = d->single_reads > 0 ? 1 : READS_PER_PASS;
+            if (d->single_reads > 0) d->single_reads--;
+            int reads = 0;
+            while (reads < max_reads && read_entry(d, &interrupted) == 1) reads++;
+            if (max_reads > 1 && reads < 2 && !interrupted) d->single_reads = SINGLE_READ_PASSES;
         }
         if (interrupted) continue;
         print_ready();
+        report_drops(false);
         wait_forever = false;
     }
 }
@@ -335,6 +424,13 @@ void LogCat::run(const char*, const char* device, int block_fd) {
     }
     WLOG(TAG_ANDROID, WLOG_DEBUG, "map Shared memory ok!");
     format = android_log_format_new();
+    char budget[PROPERTY_VALUE_MAX];
+    property_get(PROP_PID_BUDGET, budget, "0");
+    long kb = atol(budget);
+    if (kb > 0 && kb <= FLOOD_BUDGET_MAX_KB) {
+        flood.set_budget(kb * 1024);
+        WLOG(TAG_ANDROID, WLOG_INFO, "entries past %ld KB/s of one pid are dropped", kb);
+    }
 
     char path[PATH_LEN];
     if (device != nullptr) {

@@ -9,11 +9,15 @@
 #include <log/logprint.h>
 
 #include "collectors/collector_link.h"
+#include "collectors/flood_guard.h"
 #include "collectors/log_device.h"
 
 // More queued entries than this and the collector is overloaded: it stops
 // holding entries back for ordering.
 constexpr int OVERLOAD_THRESHOLD = 9999;
+// The same when the held entries take more bytes than this: any app can write
+// entries of the longest payload, and 10,000 of those would take 40 MB.
+constexpr size_t OVERLOAD_BYTES = 4 << 20;
 
 class LogCat : public CollectorLink {
   public:
@@ -39,15 +43,19 @@ class LogCat : public CollectorLink {
     // Selects "threadtime"; 0 when the library does not know it.
     int set_output_format();
     // Queues one entry's bytes as read from device. Returns 1, or 0 when they
-    // were not a whole entry (dropped) or memory is short.
+    // were not a whole entry (dropped), memory is short, or the writer is past
+    // its budget (flood; counted there).
     int take_entry(LogDevice* device, const char* raw, size_t n);
+    // Sends the summary lines of the flood drops that are due (all of them
+    // when `all`), each a "threadtime" line of the collector's own.
+    void report_drops(bool all);
     // After a pass that read data: sends what is safe to send, holding back
     // an entry that is alone in its device's queue (an older one of another
     // device may still be unread) unless the collector is overloaded.
     void print_ready();
     // Sends everything queued, oldest first, and every rendered line.
     void print_all();
-    // Lines go out in batches of up to 4 KB, one send each: a stream costs a
+    // Lines go out in batches of up to 16 KB, one send each: a stream costs a
     // send per batch rather than per line. Sends the batch so far.
     void flush_output();
     // The reading loop over the open devices; never returns.
@@ -56,8 +64,10 @@ class LogCat : public CollectorLink {
     LogDevice* devices = nullptr;
     int device_count = 0;
     int queued_count = 0;
+    size_t queued_bytes = 0;  // blocks of the queued entries, headers included
     bool overloaded = false;
     EventTagMap* event_tag_map = nullptr;
+    FloodGuard flood;  // off unless PROP_PID_BUDGET is set
 
   private:
     void print_next_entry(LogDevice* device);
@@ -78,7 +88,7 @@ class LogCat : public CollectorLink {
     AndroidLogFormat* format = nullptr;
     char event_text[1024];  // decoded binary values
     char event_tag[64];     // an event's tag name from the tag map
-    char output[4096];      // rendered lines not sent yet
+    char output[16384];     // rendered lines not sent yet
     size_t output_len = 0;
     bool marker_queued = false;  // this overload's marker is queued (or sent)
 };

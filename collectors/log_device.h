@@ -10,6 +10,7 @@ struct LogDevice {
     log_id_t log_id = LOG_ID_MAIN;
     int fd = -1;
     bool printed = false;           // its first entry was printed or dropped
+    int single_reads = 0;           // passes left that read one entry only: it had no backlog
     QueuedEntry* queue = nullptr;   // oldest entry, null when empty
     QueuedEntry* tail = nullptr;    // newest entry (valid while queue is set)
     LogDevice* next = nullptr;      // next device of the collector, or null

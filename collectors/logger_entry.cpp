@@ -24,12 +24,34 @@ static void put_le32(char* p, uint32_t v) {
     for (int i = 0; i < 4; i++) p[i] = static_cast<char>((v >> (8 * i)) & 0xff);
 }
 
+// Freed blocks of ENTRY_BLOCK_SIZE bytes, linked through next. A collector
+// process is single-threaded.
+static QueuedEntry* pool = nullptr;
+static int pool_count = 0;
+
+static QueuedEntry* take_block() {
+    QueuedEntry* block = pool;
+    if (block == nullptr) return static_cast<QueuedEntry*>(malloc(ENTRY_BLOCK_SIZE));
+    pool = block->next;
+    pool_count--;
+    return block;
+}
+
+void trim_entry_pool(int keep) {
+    while (pool_count > keep) {
+        QueuedEntry* block = pool;
+        pool = block->next;
+        pool_count--;
+        free(block);
+    }
+}
+
 QueuedEntry* adapt_legacy_entry(const char* raw, size_t n, log_id_t log_id) {
     if (n < LEGACY_HEADER_SIZE) return nullptr;
     size_t len = le16(raw);
     if (len > n - LEGACY_HEADER_SIZE) return nullptr;
     size_t size = offsetof(QueuedEntry, entry) + sizeof(logger_entry) + len + 1;
-    QueuedEntry* queued = static_cast<QueuedEntry*>(malloc(size));
+    QueuedEntry* queued = size <= ENTRY_BLOCK_SIZE ? take_block() : static_cast<QueuedEntry*>(malloc(size));
     if (queued == nullptr) return nullptr;
     queued->prev = nullptr;
     queued->next = nullptr;
@@ -47,7 +69,15 @@ QueuedEntry* adapt_legacy_entry(const char* raw, size_t n, log_id_t log_id) {
     return queued;
 }
 
-void free_queued_entry(QueuedEntry* queued) { free(queued); }
+void free_queued_entry(QueuedEntry* queued) {
+    if (queued != nullptr && queued_entry_size(queued) <= ENTRY_BLOCK_SIZE && pool_count < ENTRY_POOL_MAX) {
+        queued->next = pool;
+        pool = queued;
+        pool_count++;
+        return;
+    }
+    free(queued);
+}
 
 size_t make_legacy_text_entry(char* out, int32_t pid, int32_t tid, uint32_t sec, uint32_t nsec,
                               int priority, const char* tag, const char* message) {

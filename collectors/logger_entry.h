@@ -40,6 +40,25 @@ QueuedEntry* adapt_legacy_entry(const char* raw, size_t n, log_id_t log_id);
 
 void free_queued_entry(QueuedEntry* queued);
 
+// Entries of up to this many bytes (queued_entry_size; nearly all of them)
+// take a block of this size from a pool of freed blocks instead of the
+// allocator: most entries live a few milliseconds, and the pool is bounded
+// by the most that are held at once (the overload's count), so it is
+// allocated once, not per entry.
+constexpr size_t ENTRY_BLOCK_SIZE = 192;
+constexpr int ENTRY_POOL_MAX = 10000;
+// Once the collector is quiet, the pool keeps this many blocks: a burst's
+// memory goes back.
+constexpr int ENTRY_POOL_QUIET = 256;
+
+// Frees pooled blocks beyond keep.
+void trim_entry_pool(int keep);
+
+// Bytes of the entry's block: what holding it costs.
+inline size_t queued_entry_size(const QueuedEntry* queued) {
+    return offsetof(QueuedEntry, entry) + sizeof(logger_entry) + queued->entry.len + 1;
+}
+
 // Writes the legacy bytes of a text entry (priority, tag, message) into out,
 // which has room for LOGGER_READ_MAX bytes; returns their count, or 0 when the
 // text does not fit.

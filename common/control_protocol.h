@@ -76,6 +76,10 @@ constexpr int CONTROL_BROADCAST_COUNT = sizeof(control_broadcasts) / sizeof(cont
 // but ended, or never started; off: not enabled for this run); "" while no run
 // is active. Updated at run start, at each death and at stop.
 #define PROP_COLLECTORS "debug.TQ.collectors"
+// The option against a flooding app: KB per second per pid; unset, 0, not a
+// number or more than FLOOD_BUDGET_MAX_KB: off.
+#define PROP_PID_BUDGET "persist.TQ.pid_budget"
+constexpr long FLOOD_BUDGET_MAX_KB = 1 << 20;
 // "SECONDS.NANOS": the wall-clock time at which the boot clock read zero, set at
 // every run start and folder switch, so that the run's properties dump lets a
 // reader give the kernel's lines (timed since boot) their wall-clock time.

@@ -24,10 +24,10 @@ namespace {
 
 const char kOut[] = "/tmp/logcat_out";
 
-// An entry dated ms milliseconds after second base.
-std::string entry(int32_t ms, const std::string& message, uint32_t base = 0) {
+// An entry dated ms milliseconds after second base, written by pid.
+std::string entry(int32_t ms, const std::string& message, uint32_t base = 0, int32_t pid = 100) {
     char raw[LOGGER_READ_MAX];
-    size_t n = make_legacy_text_entry(raw, 100, 101, base + ms / 1000, (ms % 1000) * 1000000u, 4, "t",
+    size_t n = make_legacy_text_entry(raw, pid, 101, base + ms / 1000, (ms % 1000) * 1000000u, 4, "t",
                                       message.c_str());
     return std::string(raw, n);
 }
@@ -146,6 +146,106 @@ TEST(LogCatMerge, EachOverloadReleasesTheHeldEntryWithOneMarkerWhateverTheClock)
         EXPECT_TRUE(exits_with(pid, 0, 30000)) << "the stream stopped moving, base " << base;
         EXPECT_TRUE(tokens(read_file(kOut)) == expect) << "base " << base;
     }
+}
+
+// As at 10,000 entries, entries of the longest payload are released with a
+// marker once they take more than the byte budget, and not before.
+TEST(LogCatMerge, ByteBudgetReleasesTheHeldEntryWithAMarker) {
+    Engine engine("MS");
+    std::string raw = entry(1000, "first");
+    engine.cat.take_entry(engine.device(0), raw.data(), raw.size());
+    std::string expect = "^main first ^system ";
+    for (int i = 0; engine.sent().empty(); i++) {
+        ASSERT_LT(i, 9999) << "not released by the bytes";
+        std::string message = "s" + std::to_string(i) + std::string(4000, 'x');
+        raw = entry(2000 + i, message);
+        engine.cat.take_entry(engine.device(1), raw.data(), raw.size());
+        bool over = engine.cat.queued_bytes > OVERLOAD_BYTES;
+        engine.cat.print_ready();
+        engine.cat.flush_output();
+        ASSERT_EQ(engine.sent().empty(), !over) << "entry " << i;
+        if (!over) expect += message + " ";
+    }
+    EXPECT_EQ(tokens(engine.sent()), expect);
+    engine.cat.print_all();
+    EXPECT_NE(lines_of(kOut).back().find("    0     0 W ORU     : trigger log"), std::string::npos)
+        << lines_of(kOut).back();
+}
+
+// With a per-pid budget: "pid bytes ms" entries, each kept (+) or dropped (-);
+// "? ms" lists the summaries due then as "pid:entries:bytes:tag".
+TEST(FloodGuard, DropsOnlyTheWriterPastItsBudgetAndTellsOnceASecond) {
+    const struct {
+        const char* name;
+        long budget;
+        std::vector<std::string> steps;
+    } cases[] = {
+        {"off", 0, {"7 4000 0 +", "7 4000 0 +", "7 4000 0 +", "? 2000 "}},
+        {"burst, then the rate",
+         1024,
+         {"7 1000 0 +", "7 1000 0 +", "7 1000 0 -", "8 1000 0 +", "7 100 0 -", "? 999 ", "7 1000 1000 +",
+          "? 1000 7:2:1100:f7 ", "? 1500 ", "7 1000 1200 -", "? 2199 ", "? 2200 7:1:1000:f7 "}},
+        {"a bucket fills to the burst only",
+         1024,
+         {"9 10 0 +", "9 10 1000 +", "9 2039 1000 -", "9 2048 60000 +", "9 10 60000 -"}},
+    };
+    for (const auto& c : cases) {
+        FloodGuard guard;
+        guard.set_budget(c.budget);
+        for (const std::string& step : c.steps) {
+            std::istringstream in(step);
+            if (step[0] == '?') {
+                std::string at;
+                in >> at >> at;
+                std::string got;
+                FloodDrops d;
+                while (guard.next_summary(std::stoll(at) * 1000, &d))
+                    got += std::to_string(d.pid) + ":" + std::to_string(d.entries) + ":" + std::to_string(d.bytes) +
+                           ":" + d.tag + " ";
+                EXPECT_EQ("? " + at + " " + got, step) << c.name;
+                continue;
+            }
+            long pid, bytes, ms;
+            std::string kept;
+            in >> pid >> bytes >> ms >> kept;
+            std::string tag = "f" + std::to_string(pid);
+            EXPECT_EQ(guard.admit(pid, tag.c_str(), bytes, ms * 1000LL), kept == "+") << c.name << ": " << step;
+        }
+    }
+}
+
+// An app floods main while another writes main and system: the other's
+// entries all go out, the flood's excess is told in one summary line.
+TEST(LogCatMerge, FloodOptionKeepsEveryOtherWritersEntries) {
+    Engine engine("MS");
+    engine.cat.flood.set_budget(4096);
+    std::string expect;
+    for (int i = 0; i < 40; i++) {
+        std::string raw = entry(1000 + i, "flood" + std::string(1000, 'x'), 0, 666);
+        engine.cat.take_entry(engine.device(0), raw.data(), raw.size());
+        std::string message = "other" + std::to_string(i);
+        raw = entry(1000 + i, message, 0, 200 + i % 2);
+        engine.cat.take_entry(engine.device(i % 2), raw.data(), raw.size());
+        engine.cat.print_ready();
+    }
+    engine.cat.print_all();
+    engine.cat.report_drops(true);
+    engine.cat.flush_output();
+    std::string others, summary;
+    int floods = 0;
+    for (const std::string& line : lines_of(kOut)) {
+        if (line.find(": other") != std::string::npos) others += line.substr(line.find(": other") + 2) + " ";
+        if (line.find(": flood") != std::string::npos) floods++;
+        if (line.find("TavloLogD: dropped") != std::string::npos) summary += line + "\n";
+    }
+    for (int i = 0; i < 40; i++) expect += "other" + std::to_string(i) + " ";
+    EXPECT_EQ(others, expect);
+    EXPECT_GT(floods, 0);
+    EXPECT_LT(floods, 40);
+    EXPECT_NE(summary.find(" W TavloLogD: dropped " + std::to_string(40 - floods) + " entries ("), std::string::npos)
+        << summary;
+    EXPECT_NE(summary.find(" of pid 666 tag t: past its budget of 4 KB/s"), std::string::npos) << summary;
+    EXPECT_EQ(count_of(summary, "\n"), 1u) << summary;
 }
 
 // The loop on two datagram socket pairs: whatever made it end, everything it

@@ -196,6 +196,24 @@ TEST_F(TransistTest, SquattedSocketNameIsReportedAndTheRunStillStops) {
     close(squatter);
 }
 
+// With nothing to write the writer sleeps without a clock; the first data
+// after that wakes it.
+TEST_F(TransistTest, IdleWriterIsWokenByData) {
+    start();
+    int kernel = connect_log_socket("Kone\n");
+    auto idle = [] {
+        pthread_mutex_lock(&queue_lock);
+        bool asleep = writer_idle;
+        pthread_mutex_unlock(&queue_lock);
+        return asleep;
+    };
+    EXPECT_TRUE(wait_for(idle, 5000));
+    EXPECT_EQ(log("kernel_log"), kHeader + "one\n");
+    send_all(kernel, "two\n");
+    EXPECT_TRUE(wait_for([&] { return log("kernel_log") == kHeader + "one\ntwo\n"; }, 3000));
+    close(kernel);
+}
+
 // With a 1000 s interval nothing would reach the file without the early cycle,
 // and the stop must not wait for the interval either.
 TEST_F(TransistTest, BurstFasterThanTheIntervalIsWrittenEarlyWithBoundedMemory) {

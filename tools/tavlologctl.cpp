@@ -147,6 +147,15 @@ static int run_status() {
     } else {
         printf("rotation size: unknown\n");
     }
+    // Read by each Android collector as a run starts.
+    char budget[PROPERTY_VALUE_MAX];
+    property_get(PROP_PID_BUDGET, budget, "0");
+    long kb = atol(budget);
+    if (kb > 0 && kb <= FLOOD_BUDGET_MAX_KB) {
+        printf("per-pid budget (%s): %ld KB/s, entries past it dropped and summarised\n", PROP_PID_BUDGET, kb);
+    } else {
+        printf("per-pid budget (%s): off, every entry kept\n", PROP_PID_BUDGET);
+    }
     print_collectors();
     return EXIT_DONE;
 }

@@ -32,12 +32,14 @@ int transist_throughput = 2;
 TransistHost* transist_host = nullptr;
 std::atomic<bool> writer_running{false};
 bool reader_paused = false;
+bool writer_idle = false;
 int reader_wake_fd = -1;
 
 // Guards the writer's wake-up flags and the reader's "done" flag.
 static pthread_mutex_t wake_lock = PTHREAD_MUTEX_INITIALIZER;
 static pthread_cond_t wake_cond;
 static bool writer_kicked = false;  // wake_lock
+static bool data_arrived = false;   // wake_lock: the reader woke the idle writer
 static bool reader_done = false;    // wake_lock
 
 // The longest period the writer's microsecond arithmetic was designed for.
@@ -72,6 +74,23 @@ void writer_sleep_us(int64_t usec) {
         if (pthread_cond_timedwait(&wake_cond, &wake_lock, &until) == ETIMEDOUT) break;
     }
     writer_kicked = false;
+    pthread_mutex_unlock(&wake_lock);
+}
+
+bool writer_idle_wait() {
+    pthread_mutex_lock(&wake_lock);
+    while (!stop_requested && !writer_kicked && !data_arrived) pthread_cond_wait(&wake_cond, &wake_lock);
+    bool kicked = writer_kicked;
+    writer_kicked = false;
+    data_arrived = false;
+    pthread_mutex_unlock(&wake_lock);
+    return kicked;
+}
+
+void wake_idle_writer() {
+    pthread_mutex_lock(&wake_lock);
+    data_arrived = true;
+    pthread_cond_broadcast(&wake_cond);
     pthread_mutex_unlock(&wake_lock);
 }
 
@@ -201,6 +220,7 @@ static void discard_leftovers() {
     }
     reset_queue_roles();
     reader_paused = false;
+    writer_idle = false;
     pthread_mutex_unlock(&queue_lock);
     node_pool_trim(0);
 }
@@ -243,6 +263,7 @@ void transist_create(TransistHost* host, const TransistRun& run) {
     }
     pthread_mutex_lock(&wake_lock);
     writer_kicked = false;
+    data_arrived = false;
     reader_done = false;
     pthread_mutex_unlock(&wake_lock);
     writer_running = true;

@@ -5,6 +5,7 @@
 #include <errno.h>
 #include <poll.h>
 #include <string.h>
+#include <sys/ioctl.h>
 #include <sys/prctl.h>
 #include <sys/socket.h>
 #include <unistd.h>
@@ -85,7 +86,10 @@ static void queue_chunk(int type, const char* data, int n) {
     pthread_mutex_lock(&queue_lock);
     int rc = queue_append(fill_queue, type, data, n, transist_capacity);
     int err = errno;
+    bool writer_was_idle = writer_idle;
+    writer_idle = false;
     pthread_mutex_unlock(&queue_lock);
+    if (writer_was_idle) wake_idle_writer();
     if (rc == 1) {
         malloc_failure_recorded = false;
     } else if (!malloc_failure_recorded) {
@@ -95,9 +99,10 @@ static void queue_chunk(int type, const char* data, int n) {
     }
 }
 
-int read_log_message(int type, int fd) {
+int read_log_message(int type, int fd, int* taken) {
     char buf[CHUNK_MAX + 1];
     ssize_t n = read(fd, buf, CHUNK_MAX);
+    if (taken != nullptr) *taken = n > 0 ? static_cast<int>(n) : 0;
     if (n < 0) {
         int err = errno;
         if (err == EAGAIN || err == EWOULDBLOCK || err == EINTR) return -1;
@@ -126,12 +131,15 @@ static void drop_connection(int type) {
 // Called with file_table_lock held.
 static bool read_available(int type, int max_chunks) {
     for (int i = 0; i < max_chunks; i++) {
-        int rc = read_log_message(type, log_files[type].sock);
+        int taken = 0;
+        int rc = read_log_message(type, log_files[type].sock, &taken);
         if (rc < 0) return true;
         if (rc == 0) {
             drop_connection(type);
             return false;
         }
+        // A short read emptied the connection: no read for EAGAIN.
+        if (taken < CHUNK_MAX) return true;
     }
     return true;
 }
@@ -323,6 +331,32 @@ static void handle_ready(const PollSet* set, int chunks_per_fd) {
     pthread_mutex_unlock(&file_table_lock);
 }
 
+// See GATHER_LOW_WATER. Called after poll reported data on registered
+// connections; last_data_us is when that happened the time before.
+static void gather_small_messages(const PollSet* set, int64_t* last_data_us) {
+    int64_t now = monotonic_us();
+    bool streaming = now - *last_data_us < GATHER_WINDOW_MS * 1000LL;
+    *last_data_us = now;
+    if (!streaming) return;
+    int waiting = 0;
+    for (int i = 2; i < set->count; i++) {
+        if (set->type[i - 2] < 0 || set->fds[i].revents == 0) continue;
+        int bytes = 0;
+        if (ioctl(set->fds[i].fd, FIONREAD, &bytes) != 0) return;  // ended or failed: read it now
+        waiting += bytes;
+    }
+    if (waiting >= GATHER_LOW_WATER) return;
+    struct pollfd wake = {reader_wake_fd, POLLIN, 0};
+    poll(&wake, 1, GATHER_WAIT_MS);
+}
+
+static bool registered_ready(const PollSet* set) {
+    for (int i = 2; i < set->count; i++) {
+        if (set->type[i - 2] >= 0 && set->fds[i].revents != 0) return true;
+    }
+    return false;
+}
+
 // Decides under queue_lock whether the fill queue is too full to take more;
 // the writer's rotation clears the state and wakes us.
 static bool queue_full() {
@@ -405,16 +439,22 @@ void* read_thread(void*) {
         return reinterpret_cast<void*>(1);
     }
 
+    int flush_ms = -1;
+    int64_t last_data_us = 0;
     while (!stop_requested) {
         bool paused = queue_full();
         PollSet set;
         build_poll_set(&set, !paused, true);
-        int timeout_ms = 1000;
+        // Only a connection that has not named its type yet and a summary of
+        // refused clients held back need a clock; otherwise the reader sleeps
+        // until a connection, data or the wake counter (stop, resume).
+        int timeout_ms = flush_ms;
         int64_t now = monotonic_us();
         for (const PendingConn& conn : pending) {
             if (conn.fd < 0 || conn.type >= 0) continue;
             int64_t left = (conn.expires - now) / 1000 + 1;
-            if (left < timeout_ms) timeout_ms = left > 0 ? static_cast<int>(left) : 0;
+            if (left < 0) left = 0;
+            if (timeout_ms < 0 || left < timeout_ms) timeout_ms = static_cast<int>(left);
         }
         int n = poll(set.fds, static_cast<nfds_t>(set.count), timeout_ms);
         if (n < 0) {
@@ -428,10 +468,11 @@ void* read_thread(void*) {
         if (n > 0) {
             if (set.fds[1].revents != 0) drain_wake_counter();
             if (set.fds[0].revents != 0) accept_connections();
-            handle_ready(&set, 1);
+            if (registered_ready(&set)) gather_small_messages(&set, &last_data_us);
+            handle_ready(&set, READS_PER_WAKE);
         }
         expire_pending(monotonic_us());
-        if (transist_host != nullptr) transist_host->flush_records();
+        flush_ms = transist_host != nullptr ? transist_host->flush_records() : -1;
     }
 
     // The listening socket stays for the next run: freed, its name could be

@@ -42,6 +42,15 @@ void wake_reader();
 
 // The writer's interruptible sleep: returns early on stop or on a kick.
 void writer_sleep_us(int64_t usec);
+
+// While nothing flows the writer keeps no clock: it sets writer_idle (under
+// queue_lock, having seen the fill queue empty) and waits in writer_idle_wait
+// until the reader queues data (the reader clears the flag under the same
+// lock and calls wake_idle_writer), a kick or the stop. Returns true when it
+// was kicked.
+extern bool writer_idle;
+bool writer_idle_wait();
+void wake_idle_writer();
 // Asks the writer for a cycle now (the reader paused on a full queue).
 void kick_writer();
 // Called once by the reader as it ends; the writer waits for it at stop.

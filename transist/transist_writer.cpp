@@ -138,6 +138,28 @@ static int finish_at_stop() {
     return rc == FLUSH_REOPEN_FAILED ? 1 : 2;
 }
 
+// After a cycle with nothing to write: when the fill queue is empty too,
+// sleeps until something happens instead of cycling on the clock. Nothing
+// needs a clock meanwhile: the free space matters only to what is written and
+// is measured again at the start of the next cycle, as every cycle does, and
+// the stop wakes the wait. Once data arrives the writer gathers for one
+// interval, as at the start of a run, and then cycles as before. Returns true
+// when the next cycle is due at once (kicked).
+static bool wait_while_idle() {
+    pthread_mutex_lock(&queue_lock);
+    writer_idle = fill_queue->total == 0;
+    bool idle = writer_idle;
+    pthread_mutex_unlock(&queue_lock);
+    if (!idle) return false;
+    bool kicked = writer_idle_wait();
+    pthread_mutex_lock(&queue_lock);
+    writer_idle = false;
+    pthread_mutex_unlock(&queue_lock);
+    if (kicked || stop_requested) return true;
+    writer_sleep_us(static_cast<int64_t>(transist_interval) * 1000000);
+    return true;
+}
+
 void* write_thread(void*) {
     prctl(PR_SET_NAME, "tavlo.writer");
     WLOG(TAG_TRANSIST, WLOG_DEBUG, "write_thread: pid: %d, tid: %d", getpid(), gettid());
@@ -156,7 +178,8 @@ void* write_thread(void*) {
         pthread_mutex_unlock(&queue_lock);
         if (resume_reader) wake_reader();
         int pooled = node_pool_bytes();
-        if (drain_queue->total != 0 && flush_queue() == FLUSH_REOPEN_FAILED) {
+        bool wrote = drain_queue->total != 0;
+        if (wrote && flush_queue() == FLUSH_REOPEN_FAILED) {
             writer_running = false;
             close_files_only();
             node_pool_trim(0);
@@ -166,6 +189,7 @@ void* write_thread(void*) {
         // likely needs as many, and an idle cycle gives them all back.
         int released = node_pool_bytes() - pooled;
         node_pool_trim(released > 0 ? released : 0);
+        if (!wrote && wait_while_idle()) continue;
         int64_t elapsed = monotonic_us() - t0;
         if (elapsed >= 0 && elapsed <= interval_us) writer_sleep_us(interval_us - elapsed);
     }
