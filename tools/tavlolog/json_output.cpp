@@ -11,9 +11,10 @@ namespace tavlolog {
 namespace {
 
 // A JSON string; bytes that are not UTF-8 become \u00NN (their value kept).
-void append_string(std::string& out, std::string_view s) {
+// At most six bytes for each of s, and the quotes.
+char* put_string(char* w, std::string_view s) {
     static const char kHex[] = "0123456789abcdef";
-    out += '"';
+    *w++ = '"';
     const unsigned char* p = reinterpret_cast<const unsigned char*>(s.data());
     const unsigned char* end = p + s.size();
     const unsigned char* plain = p;
@@ -30,100 +31,149 @@ void append_string(std::string& out, std::string_view s) {
                 continue;
             }
         }
-        out.append(reinterpret_cast<const char*>(plain), static_cast<size_t>(p - plain));
+        memcpy(w, plain, static_cast<size_t>(p - plain));
+        w += p - plain;
+        *w++ = '\\';
         if (c == '"' || c == '\\') {
-            out += '\\';
-            out += static_cast<char>(c);
+            *w++ = static_cast<char>(c);
         } else if (c == '\n') {
-            out += "\\n";
+            *w++ = 'n';
         } else if (c == '\t') {
-            out += "\\t";
+            *w++ = 't';
         } else {
-            char esc[6] = {'\\', 'u', '0', '0', kHex[c >> 4], kHex[c & 15]};
-            out.append(esc, 6);
+            w[0] = 'u';
+            w[1] = '0';
+            w[2] = '0';
+            w[3] = kHex[c >> 4];
+            w[4] = kHex[c & 15];
+            w += 5;
         }
         plain = ++p;
     }
-    out.append(reinterpret_cast<const char*>(plain), static_cast<size_t>(end - plain));
-    out += '"';
+    memcpy(w, plain, static_cast<size_t>(end - plain));
+    w += end - plain;
+    *w++ = '"';
+    return w;
 }
+
+template <size_t N>
+char* put(char* w, const char (&text)[N]) {
+    memcpy(w, text, N - 1);
+    return w + N - 1;
+}
+
+char* put(char* w, const std::string& text) {
+    memcpy(w, text.data(), text.size());
+    return w + text.size();
+}
+
+// A field's text that changes seldom from one entry to the next, kept
+// written out while its value stays.
+struct Cached {
+    std::string key, text;
+    bool fits(std::string_view k) const { return key.size() == k.size() && memcmp(key.data(), k.data(), k.size()) == 0; }
+};
 
 class JsonOutput : public Sink {
   public:
-    explicit JsonOutput(FILE* out) : out_(out) {}
+    explicit JsonOutput(FILE* out) : out_(out) {
+        for (int p = PRIO_NONE; p <= PRIO_VERBOSE; p++) {
+            std::string& t = priority_[p + 1];
+            if (p == PRIO_NONE) {
+                t = ",\"priority\":null,\"priority_name\":null";
+            } else {
+                t = ",\"priority\":" + std::to_string(p) + ",\"priority_name\":\"" + priority_name(p) + "\"";
+            }
+        }
+        for (int s = 0; s < SRC_COUNT; s++)
+            source_[s] = std::string(",\"source\":\"") + source_name(static_cast<Source>(s)) + "\"";
+        for (int k = KIND_LINE; k <= KIND_MALFORMED; k++)
+            kind_[k] = std::string(",\"kind\":\"") + kind_name(static_cast<Kind>(k)) + "\",\"file\":";
+        file_.text = "\"\"";
+    }
 
     void entry(const Entry& e) override {
-        std::string& t = out_.text();
-        t += "{\"time\":";
+        if (!file_.fits(e.file)) {
+            file_.key.assign(e.file.data(), e.file.size());
+            file_.text = escaped(e.file);
+        }
+        std::string_view boot_name = e.boot_name.empty() ? std::string_view("run") : e.boot_name;
+        if (!run_.fits(e.run) || !boot_name_.fits(boot_name) || e.boot != boot_) {
+            run_.key.assign(e.run.data(), e.run.size());
+            boot_name_.key.assign(boot_name.data(), boot_name.size());
+            boot_ = e.boot;
+            tail_ = ",\"boot\":" + std::to_string(e.boot) + ",\"boot_name\":" + escaped(boot_name) +
+                    ",\"run\":" + escaped(e.run) + "}\n";
+        }
+        // The longest form: the fixed fields and every byte of tag and message escaped.
+        char* w = out_.reserve(384 + file_.text.size() + tail_.size() + 6 * (e.tag.size() + e.message.size()));
+        w = put(w, "{\"time\":");
         if (e.has_instant) {
-            t += '"';
-            time_.local(t, e.instant_ns, e.utc_offset_s, 'T', 9);
+            *w++ = '"';
+            w = time_.local(w, e.instant_ns, e.utc_offset_s, 'T', 9);
             int32_t off = e.utc_offset_s;
             if (off == 0) {
-                t += 'Z';
+                *w++ = 'Z';
             } else {
-                char zone[8];
                 int a = off < 0 ? -off : off;
-                snprintf(zone, sizeof(zone), "%c%02d:%02d", off < 0 ? '-' : '+', a / 3600 % 100, a / 60 % 60);
-                t += zone;
+                *w++ = off < 0 ? '-' : '+';
+                put_digits(w, static_cast<uint32_t>(a / 3600 % 100));
+                w[2] = ':';
+                put_digits(w + 3, static_cast<uint32_t>(a / 60 % 60));
+                w += 5;
             }
-            t += '"';
+            *w++ = '"';
         } else {
-            t += "null";
+            w = put(w, "null");
         }
-        t += ",\"inherited\":";
-        t += e.inherited ? "true" : "false";
-        t += ",\"uptime\":";
+        w = e.inherited ? put(w, ",\"inherited\":true,\"uptime\":") : put(w, ",\"inherited\":false,\"uptime\":");
         if (e.uptime_ns >= 0) {
-            append_number(t, e.uptime_ns / 1000000000);
-            t += '.';
-            char frac[9];
-            int64_t f = e.uptime_ns % 1000000000;
-            for (int i = 8; i >= 0; i--, f /= 10) frac[i] = static_cast<char>('0' + f % 10);
-            t.append(frac, 9);
+            w = put_number(w, e.uptime_ns / 1000000000);
+            *w++ = '.';
+            uint32_t f = static_cast<uint32_t>(e.uptime_ns % 1000000000);
+            *w++ = static_cast<char>('0' + f / 100000000);
+            f %= 100000000;
+            put_digits(w, f / 1000000);
+            put_digits(w + 2, f / 10000 % 100);
+            put_digits(w + 4, f / 100 % 100);
+            put_digits(w + 6, f % 100);
+            w += 8;
         } else {
-            t += "null";
+            w = put(w, "null");
         }
-        t += ",\"source\":\"";
-        t += source_name(e.source);
-        t += "\",\"priority\":";
-        if (e.priority == PRIO_NONE) {
-            t += "null,\"priority_name\":null";
-        } else {
-            append_number(t, e.priority);
-            t += ",\"priority_name\":\"";
-            t += priority_name(e.priority);
-            t += '"';
-        }
-        t += ",\"pid\":";
-        if (e.pid >= 0) append_number(t, e.pid); else t += "null";
-        t += ",\"tid\":";
-        if (e.tid >= 0) append_number(t, e.tid); else t += "null";
-        t += ",\"tag\":";
-        append_string(t, e.tag);
-        t += ",\"message\":";
-        append_string(t, e.message);
-        t += ",\"kind\":\"";
-        t += kind_name(e.kind);
-        t += "\",\"file\":";
-        append_string(t, e.file);
-        t += ",\"offset\":";
-        append_number(t, static_cast<int64_t>(e.offset));
-        t += ",\"boot\":";
-        append_number(t, e.boot);
-        t += ",\"boot_name\":";
-        append_string(t, e.boot_name.empty() ? std::string_view("run") : e.boot_name);
-        t += ",\"run\":";
-        append_string(t, e.run);
-        t += "}\n";
-        out_.maybe_flush();
+        w = put(w, source_[e.source < SRC_COUNT ? e.source : 0]);
+        w = put(w, priority_[e.priority >= PRIO_NONE && e.priority <= PRIO_VERBOSE ? e.priority + 1 : 0]);
+        w = put(w, ",\"pid\":");
+        w = e.pid >= 0 ? put_number(w, e.pid) : put(w, "null");
+        w = put(w, ",\"tid\":");
+        w = e.tid >= 0 ? put_number(w, e.tid) : put(w, "null");
+        w = put(w, ",\"tag\":");
+        w = put_string(w, e.tag);
+        w = put(w, ",\"message\":");
+        w = put_string(w, e.message);
+        w = put(w, kind_[e.kind <= KIND_MALFORMED ? e.kind : 0]);
+        w = put(w, file_.text);
+        w = put(w, ",\"offset\":");
+        w = put_number(w, static_cast<int64_t>(e.offset));
+        w = put(w, tail_);
+        out_.commit(w);
     }
 
     void idle() override { out_.flush(); }
 
   private:
+    static std::string escaped(std::string_view s) {
+        std::string t(6 * s.size() + 2, '\0');
+        t.resize(static_cast<size_t>(put_string(&t[0], s) - t.data()));
+        return t;
+    }
+
     OutBuffer out_;
     TimeFormat time_;
+    std::string priority_[PRIO_VERBOSE + 2], source_[SRC_COUNT], kind_[KIND_MALFORMED + 1];
+    Cached file_, run_, boot_name_;
+    int boot_ = 0;
+    std::string tail_;
 };
 
 }  // namespace

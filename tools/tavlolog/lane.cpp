@@ -163,34 +163,59 @@ Lane::Read Lane::next_line(std::string_view* line, uint64_t* offset, const std::
 }
 
 namespace {
-// The heap's order: the latest on top of std::*_heap is the earliest instant.
-bool later(const Lane::Held& a, const Lane::Held& b) { return a.key != b.key ? a.key > b.key : a.seq > b.seq; }
+// std::*_heap keep the greatest on top: the latest is the earliest instant.
+bool later(const Lane::Slot& a, const Lane::Slot& b) { return a.key != b.key ? a.key > b.key : a.order > b.order; }
 }  // namespace
 
 bool Lane::next() {
     if (!reorders_) return read_one();
-    while (heap_.size() < kReorderEntries && heap_bytes_ < kReorderBytes && read_one()) {
-        Held h;
-        h.entry = entry_;
-        h.key = key_;
-        h.seq = seq_++;
-        h.tag.assign(entry_.tag.data(), entry_.tag.size());
-        h.message.assign(entry_.message.data(), entry_.message.size());
-        h.file.assign(entry_.file.data(), entry_.file.size());
-        heap_bytes_ += h.message.size() + h.tag.size() + sizeof(Held);
-        heap_.push_back(std::move(h));
-        std::push_heap(heap_.begin(), heap_.end(), later);
+    if (out_slot_ != UINT32_MAX) {
+        // A rare long line gives its room back rather than keep it in a slot.
+        if (held_[out_slot_].text.capacity() > 1024) std::string().swap(held_[out_slot_].text);
+        free_.push_back(out_slot_);
+        out_slot_ = UINT32_MAX;
+        out_ = &none_;
     }
+    while (heap_.size() < kReorderEntries && held_bytes_ < kReorderBytes && read_one()) hold();
     if (heap_.empty()) return false;
     std::pop_heap(heap_.begin(), heap_.end(), later);
-    out_ = std::move(heap_.back());
+    out_slot_ = static_cast<uint32_t>(heap_.back().order & 0xffff);
     heap_.pop_back();
-    heap_bytes_ -= out_.message.size() + out_.tag.size() + sizeof(Held);
-    // The views point into the copies, which stay until the next call.
-    out_.entry.tag = out_.tag;
-    out_.entry.message = out_.message;
-    out_.entry.file = out_.file;
+    Held& h = held_[out_slot_];
+    size_t tag = h.entry.tag.size(), message = h.entry.message.size();
+    held_bytes_ -= tag + message + kHeldCost;
+    // The views point into the copy, which stays until the next call.
+    const char* text = h.text.data();
+    h.entry.tag = std::string_view(text, tag);
+    h.entry.message = std::string_view(text + tag, message);
+    h.entry.file = std::string_view(text + tag + message, h.entry.file.size());
+    out_ = &h;
     return true;
+}
+
+void Lane::hold() {
+    static_assert(kReorderEntries < 0xffff, "a slot's number fits its record");
+    if (held_.empty()) {
+        held_.reserve(kReorderEntries + 1);
+        heap_.reserve(kReorderEntries);
+    }
+    uint32_t slot;
+    if (free_.empty()) {
+        slot = static_cast<uint32_t>(held_.size());
+        held_.emplace_back();
+    } else {
+        slot = free_.back();
+        free_.pop_back();
+    }
+    Held& h = held_[slot];
+    h.entry = entry_;
+    h.key = key_;
+    h.text.assign(entry_.tag.data(), entry_.tag.size());
+    h.text.append(entry_.message.data(), entry_.message.size());
+    h.text.append(entry_.file.data(), entry_.file.size());
+    held_bytes_ += entry_.tag.size() + entry_.message.size() + kHeldCost;
+    heap_.push_back(Slot{key_, arrivals_++ << 16 | slot});
+    std::push_heap(heap_.begin(), heap_.end(), later);
 }
 
 bool Lane::read_one() {

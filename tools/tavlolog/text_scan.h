@@ -1,16 +1,33 @@
 // Helpers of the outputs' hot path: numbers without printf, and a scan that
-// passes plain ASCII eight bytes at a time.
+// passes plain ASCII sixteen (without SSE2 eight) bytes at a time.
 #pragma once
 
 #include <cstdint>
 #include <cstring>
-#include <string>
+
+#if defined(__SSE2__)
+#include <emmintrin.h>
+#endif
 
 namespace tavlolog {
 
 // The first byte from p that is not printable ASCII (below 0x20, 0x7f or
 // above), or, with json, also '"' or '\\'; end when there is none.
 inline const unsigned char* plain_until(const unsigned char* p, const unsigned char* end, bool json) {
+#if defined(__SSE2__)
+    const __m128i low = _mm_set1_epi8(0x1f), del = _mm_set1_epi8(0x7f);
+    const __m128i quote = _mm_set1_epi8('"'), backslash = _mm_set1_epi8('\\');
+    while (end - p >= 16) {
+        __m128i x = _mm_loadu_si128(reinterpret_cast<const __m128i*>(p));
+        // Signed: the bytes from 0x80 are negative, so below 0x20 too.
+        __m128i good = _mm_and_si128(_mm_cmpgt_epi8(x, low), _mm_cmplt_epi8(x, del));
+        if (json)
+            good = _mm_andnot_si128(_mm_or_si128(_mm_cmpeq_epi8(x, quote), _mm_cmpeq_epi8(x, backslash)), good);
+        unsigned mask = static_cast<unsigned>(_mm_movemask_epi8(good));
+        if (mask != 0xffff) return p + __builtin_ctz(~mask);
+        p += 16;
+    }
+#else
     constexpr uint64_t ones = 0x0101010101010101ULL, highs = 0x8080808080808080ULL;
     while (end - p >= 8) {
         uint64_t x;
@@ -24,6 +41,7 @@ inline const unsigned char* plain_until(const unsigned char* p, const unsigned c
         if (bad & highs) break;
         p += 8;
     }
+#endif
     for (; p < end; p++) {
         unsigned char c = *p;
         if (c < 0x20 || c >= 0x7f || (json && (c == '"' || c == '\\'))) break;
@@ -31,20 +49,41 @@ inline const unsigned char* plain_until(const unsigned char* p, const unsigned c
     return p;
 }
 
-// Appends v in decimal, right-aligned in width.
-inline void append_number(std::string& out, int64_t v, int width = 0) {
+// Two decimal digits of v (below 100) at p.
+inline void put_digits(char* p, uint32_t v) {
+    static const char kPairs[] =
+        "00010203040506070809101112131415161718192021222324252627282930313233343536373839"
+        "40414243444546474849505152535455565758596061626364656667686970717273747576777879"
+        "8081828384858687888990919293949596979899";
+    memcpy(p, kPairs + 2 * v, 2);
+}
+
+// Writes v in decimal at p, right-aligned in width: the end. At most 20 bytes
+// or width.
+inline char* put_number(char* p, int64_t v, int width = 0) {
     char text[24];
     char* end = text + sizeof(text);
-    char* p = end;
+    char* q = end;
     uint64_t u = v < 0 ? static_cast<uint64_t>(-(v + 1)) + 1 : static_cast<uint64_t>(v);
-    do {
-        *--p = static_cast<char>('0' + u % 10);
-        u /= 10;
-    } while (u != 0);
-    if (v < 0) *--p = '-';
-    int len = static_cast<int>(end - p);
-    if (len < width) out.append(static_cast<size_t>(width - len), ' ');
-    out.append(p, static_cast<size_t>(len));
+    while (u >= 100) {
+        q -= 2;
+        put_digits(q, static_cast<uint32_t>(u % 100));
+        u /= 100;
+    }
+    if (u >= 10) {
+        q -= 2;
+        put_digits(q, static_cast<uint32_t>(u));
+    } else {
+        *--q = static_cast<char>('0' + u);
+    }
+    if (v < 0) *--q = '-';
+    int len = static_cast<int>(end - q);
+    if (len < width) {
+        memset(p, ' ', static_cast<size_t>(width - len));
+        p += width - len;
+    }
+    memcpy(p, q, static_cast<size_t>(len));
+    return p + len;
 }
 
 }  // namespace tavlolog
