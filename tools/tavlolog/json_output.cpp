@@ -11,15 +11,14 @@ namespace tavlolog {
 namespace {
 
 // A JSON string; bytes that are not UTF-8 become \u00NN (their value kept).
-// At most six bytes for each of s, and the quotes.
+// At most six bytes for each of s, the quotes, and 16 of room beyond.
 char* put_string(char* w, std::string_view s) {
     static const char kHex[] = "0123456789abcdef";
     *w++ = '"';
     const unsigned char* p = reinterpret_cast<const unsigned char*>(s.data());
     const unsigned char* end = p + s.size();
-    const unsigned char* plain = p;
     while (p < end) {
-        p = plain_until(p, end, true);
+        p = copy_plain(w, p, end, true);
         if (p == end) break;
         unsigned char c = *p;
         if (c >= 0x80) {
@@ -27,12 +26,10 @@ char* put_string(char* w, std::string_view s) {
             bool whole = more > 0 && end - p > more;
             for (int i = 1; whole && i <= more; i++) whole = (p[i] & 0xc0) == 0x80;
             if (whole) {
-                p += more + 1;
+                for (int i = 0; i <= more; i++) *w++ = static_cast<char>(*p++);
                 continue;
             }
         }
-        memcpy(w, plain, static_cast<size_t>(p - plain));
-        w += p - plain;
         *w++ = '\\';
         if (c == '"' || c == '\\') {
             *w++ = static_cast<char>(c);
@@ -48,10 +45,8 @@ char* put_string(char* w, std::string_view s) {
             w[4] = kHex[c & 15];
             w += 5;
         }
-        plain = ++p;
+        p++;
     }
-    memcpy(w, plain, static_cast<size_t>(end - plain));
-    w += end - plain;
     *w++ = '"';
     return w;
 }
@@ -62,51 +57,76 @@ char* put(char* w, const char (&text)[N]) {
     return w + N - 1;
 }
 
-char* put(char* w, const std::string& text) {
-    memcpy(w, text.data(), text.size());
-    return w + text.size();
-}
+// A field's text written out once: kept with room beyond it, so that a short
+// one is copied in one fixed block (the output has the room too).
+class Written {
+  public:
+    static constexpr size_t kBlock = 64;
+    void set(const std::string& text) {
+        text_ = text;
+        size_ = text.size();
+        text_.append(kBlock, '\0');
+    }
+    size_t size() const { return size_; }
+    char* put(char* w) const {
+        if (size_ <= kBlock)
+            memcpy(w, text_.data(), kBlock);
+        else
+            memcpy(w, text_.data(), size_);
+        return w + size_;
+    }
 
-// A field's text that changes seldom from one entry to the next, kept
-// written out while its value stays.
-struct Cached {
-    std::string key, text;
-    bool fits(std::string_view k) const { return key.size() == k.size() && memcmp(key.data(), k.data(), k.size()) == 0; }
+  private:
+    std::string text_;
+    size_t size_ = 0;
 };
+
+bool same(std::string_view a, const std::string& b) {
+    if (a.size() != b.size()) return false;
+    for (size_t i = 0; i < a.size(); i++)
+        if (a[i] != b[i]) return false;
+    return true;
+}
 
 class JsonOutput : public Sink {
   public:
     explicit JsonOutput(FILE* out) : out_(out) {
         for (int p = PRIO_NONE; p <= PRIO_VERBOSE; p++) {
-            std::string& t = priority_[p + 1];
-            if (p == PRIO_NONE) {
-                t = ",\"priority\":null,\"priority_name\":null";
-            } else {
-                t = ",\"priority\":" + std::to_string(p) + ",\"priority_name\":\"" + priority_name(p) + "\"";
-            }
+            priority_[p + 1].set(p == PRIO_NONE ? std::string(",\"priority\":null,\"priority_name\":null")
+                                                : ",\"priority\":" + std::to_string(p) + ",\"priority_name\":\"" +
+                                                      priority_name(p) + "\"");
         }
         for (int s = 0; s < SRC_COUNT; s++)
-            source_[s] = std::string(",\"source\":\"") + source_name(static_cast<Source>(s)) + "\"";
+            source_[s].set(std::string(",\"source\":\"") + source_name(static_cast<Source>(s)) + "\"");
         for (int k = KIND_LINE; k <= KIND_MALFORMED; k++)
-            kind_[k] = std::string(",\"kind\":\"") + kind_name(static_cast<Kind>(k)) + "\",\"file\":";
-        file_.text = "\"\"";
+            kind_[k].set(std::string(",\"kind\":\"") + kind_name(static_cast<Kind>(k)) + "\",\"file\":");
+        file_.set("\"\"");
     }
 
+    // A section's entries name its texts from one place; another section
+    // may have others at the same place.
+    void section(const SectionInfo&) override { fresh_ = true; }
+
     void entry(const Entry& e) override {
-        if (!file_.fits(e.file)) {
-            file_.key.assign(e.file.data(), e.file.size());
-            file_.text = escaped(e.file);
+        if (!same(e.file, file_name_)) {
+            file_name_.assign(e.file.data(), e.file.size());
+            file_.set(escaped(e.file));
         }
-        std::string_view boot_name = e.boot_name.empty() ? std::string_view("run") : e.boot_name;
-        if (!run_.fits(e.run) || !boot_name_.fits(boot_name) || e.boot != boot_) {
-            run_.key.assign(e.run.data(), e.run.size());
-            boot_name_.key.assign(boot_name.data(), boot_name.size());
+        if (fresh_ || e.run.data() != run_ || e.run.size() != run_size_ || e.boot_name.data() != boot_name_ ||
+            e.boot_name.size() != boot_name_size_ || e.boot != boot_) {
+            fresh_ = false;
+            run_ = e.run.data();
+            run_size_ = e.run.size();
+            boot_name_ = e.boot_name.data();
+            boot_name_size_ = e.boot_name.size();
             boot_ = e.boot;
-            tail_ = ",\"boot\":" + std::to_string(e.boot) + ",\"boot_name\":" + escaped(boot_name) +
-                    ",\"run\":" + escaped(e.run) + "}\n";
+            tail_.set(",\"boot\":" + std::to_string(e.boot) + ",\"boot_name\":" +
+                      escaped(e.boot_name.empty() ? std::string_view("run") : e.boot_name) +
+                      ",\"run\":" + escaped(e.run) + "}\n");
         }
-        // The longest form: the fixed fields and every byte of tag and message escaped.
-        char* w = out_.reserve(384 + file_.text.size() + tail_.size() + 6 * (e.tag.size() + e.message.size()));
+        // The longest form: the fixed fields, every byte of tag and message
+        // escaped, and the room the copies may write beyond.
+        char* w = out_.reserve(512 + file_.size() + tail_.size() + 6 * (e.tag.size() + e.message.size()));
         w = put(w, "{\"time\":");
         if (e.has_instant) {
             *w++ = '"';
@@ -141,8 +161,8 @@ class JsonOutput : public Sink {
         } else {
             w = put(w, "null");
         }
-        w = put(w, source_[e.source < SRC_COUNT ? e.source : 0]);
-        w = put(w, priority_[e.priority >= PRIO_NONE && e.priority <= PRIO_VERBOSE ? e.priority + 1 : 0]);
+        w = source_[e.source < SRC_COUNT ? e.source : 0].put(w);
+        w = priority_[e.priority >= PRIO_NONE && e.priority <= PRIO_VERBOSE ? e.priority + 1 : 0].put(w);
         w = put(w, ",\"pid\":");
         w = e.pid >= 0 ? put_number(w, e.pid) : put(w, "null");
         w = put(w, ",\"tid\":");
@@ -151,11 +171,11 @@ class JsonOutput : public Sink {
         w = put_string(w, e.tag);
         w = put(w, ",\"message\":");
         w = put_string(w, e.message);
-        w = put(w, kind_[e.kind <= KIND_MALFORMED ? e.kind : 0]);
-        w = put(w, file_.text);
+        w = kind_[e.kind <= KIND_MALFORMED ? e.kind : 0].put(w);
+        w = file_.put(w);
         w = put(w, ",\"offset\":");
         w = put_number(w, static_cast<int64_t>(e.offset));
-        w = put(w, tail_);
+        w = tail_.put(w);
         out_.commit(w);
     }
 
@@ -163,17 +183,21 @@ class JsonOutput : public Sink {
 
   private:
     static std::string escaped(std::string_view s) {
-        std::string t(6 * s.size() + 2, '\0');
+        std::string t(6 * s.size() + 32, '\0');
         t.resize(static_cast<size_t>(put_string(&t[0], s) - t.data()));
         return t;
     }
 
     OutBuffer out_;
     TimeFormat time_;
-    std::string priority_[PRIO_VERBOSE + 2], source_[SRC_COUNT], kind_[KIND_MALFORMED + 1];
-    Cached file_, run_, boot_name_;
+    Written priority_[PRIO_VERBOSE + 2], source_[SRC_COUNT], kind_[KIND_MALFORMED + 1];
+    std::string file_name_;
+    Written file_, tail_;
+    const char* run_ = nullptr;
+    const char* boot_name_ = nullptr;
+    size_t run_size_ = 0, boot_name_size_ = 0;
     int boot_ = 0;
-    std::string tail_;
+    bool fresh_ = true;
 };
 
 }  // namespace

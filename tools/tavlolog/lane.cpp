@@ -8,6 +8,7 @@
 #include <algorithm>
 #include <cstring>
 
+#include "tools/tavlolog/text_scan.h"
 #include "tools/tavlolog/warnings.h"
 
 namespace tavlolog {
@@ -40,11 +41,9 @@ bool printable(std::string_view s) {
     const unsigned char* p = reinterpret_cast<const unsigned char*>(s.data());
     const unsigned char* end = p + s.size();
     while (p < end) {
+        p = plain_until(p, end, false);
+        if (p == end) break;
         unsigned char c = *p;
-        if (c >= 0x20 && c < 0x7f) {
-            p++;
-            continue;
-        }
         if (c == '\t' || (c == '\r' && p + 1 == end)) {
             p++;
             continue;
@@ -164,21 +163,25 @@ Lane::Read Lane::next_line(std::string_view* line, uint64_t* offset, const std::
 
 namespace {
 // std::*_heap keep the greatest on top: the latest is the earliest instant.
-bool later(const Lane::Slot& a, const Lane::Slot& b) { return a.key != b.key ? a.key > b.key : a.order > b.order; }
+struct Later {
+    bool operator()(const Lane::Slot& a, const Lane::Slot& b) const {
+        return a.key != b.key ? a.key > b.key : a.order > b.order;
+    }
+};
 }  // namespace
 
 bool Lane::next() {
     if (!reorders_) return read_one();
     if (out_slot_ != UINT32_MAX) {
         // A rare long line gives its room back rather than keep it in a slot.
-        if (held_[out_slot_].text.capacity() > 1024) std::string().swap(held_[out_slot_].text);
+        if (held_[out_slot_].text.capacity() > 2048) std::string().swap(held_[out_slot_].text);
         free_.push_back(out_slot_);
         out_slot_ = UINT32_MAX;
         out_ = &none_;
     }
     while (heap_.size() < kReorderEntries && held_bytes_ < kReorderBytes && read_one()) hold();
     if (heap_.empty()) return false;
-    std::pop_heap(heap_.begin(), heap_.end(), later);
+    std::pop_heap(heap_.begin(), heap_.end(), Later());
     out_slot_ = static_cast<uint32_t>(heap_.back().order & 0xffff);
     heap_.pop_back();
     Held& h = held_[out_slot_];
@@ -215,7 +218,7 @@ void Lane::hold() {
     h.text.append(entry_.file.data(), entry_.file.size());
     held_bytes_ += entry_.tag.size() + entry_.message.size() + kHeldCost;
     heap_.push_back(Slot{key_, arrivals_++ << 16 | slot});
-    std::push_heap(heap_.begin(), heap_.end(), later);
+    std::push_heap(heap_.begin(), heap_.end(), Later());
 }
 
 bool Lane::read_one() {

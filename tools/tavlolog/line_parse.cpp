@@ -106,10 +106,13 @@ bool parse_threadtime(std::string_view line, ParsedLine* out) {
     if (letter < 'A' || letter > 'Z') return false;
     p += 3;
     // The tag is padded to 8 and followed by ": "; a tag may hold spaces.
-    const void* colon = memmem(p, static_cast<size_t>(end - p), ": ", 2);
+    const char* colon = p;
+    while ((colon = static_cast<const char*>(memchr(colon, ':', static_cast<size_t>(end - colon)))) != nullptr &&
+           (colon + 1 == end || colon[1] != ' '))
+        colon++;
     const char* tag_end;
     if (colon != nullptr) {
-        tag_end = static_cast<const char*>(colon);
+        tag_end = colon;
         out->message = std::string_view(tag_end + 2, static_cast<size_t>(end - tag_end - 2));
     } else if (end - p >= 1 && end[-1] == ':') {
         tag_end = end - 1;  // an empty message

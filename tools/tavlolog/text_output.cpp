@@ -13,34 +13,31 @@ namespace {
 constexpr int kTimeWidth = 26;
 
 // Writes s with control bytes and broken UTF-8 shown as \xNN (at most four
-// bytes for each of s).
+// bytes for each of s, and 16 of room beyond).
 char* put_escaped(char* w, std::string_view s) {
     const unsigned char* p = reinterpret_cast<const unsigned char*>(s.data());
     const unsigned char* end = p + s.size();
-    const unsigned char* plain = p;
     static const char kHex[] = "0123456789abcdef";
     while (p < end) {
-        p = plain_until(p, end, false);
+        p = copy_plain(w, p, end, false);
         if (p == end) break;
         unsigned char c = *p;
         int more = c >= 0xf0 && c < 0xf5 ? 3 : c >= 0xe0 && c < 0xf0 ? 2 : c >= 0xc2 && c < 0xe0 ? 1 : -1;
         bool whole = more > 0 && end - p > more;
         for (int i = 1; whole && i <= more; i++) whole = (p[i] & 0xc0) == 0x80;
         if (whole || c == '\t') {
-            p += whole ? more + 1 : 1;
+            int n = whole ? more + 1 : 1;
+            for (int i = 0; i < n; i++) *w++ = static_cast<char>(*p++);
             continue;
         }
-        memcpy(w, plain, static_cast<size_t>(p - plain));
-        w += p - plain;
         w[0] = '\\';
         w[1] = 'x';
         w[2] = kHex[c >> 4];
         w[3] = kHex[c & 15];
         w += 4;
-        plain = ++p;
+        p++;
     }
-    memcpy(w, plain, static_cast<size_t>(end - plain));
-    return w + (end - plain);
+    return w;
 }
 
 template <size_t N>
@@ -87,8 +84,9 @@ class TextOutput : public Sink {
     }
 
     void entry(const Entry& e) override {
-        // The longest form: colours, time, columns, the file, and every byte escaped.
-        char* w = out_.reserve(160 + e.file.size() + 4 * (e.tag.size() + e.message.size()));
+        // The longest form: colours, time, columns, the file, every byte escaped,
+        // and the room a copy may write beyond.
+        char* w = out_.reserve(256 + e.file.size() + 4 * (e.tag.size() + e.message.size()));
         const char* colour = colour_ ? colour_of(e) : nullptr;
         if (colour != nullptr) w = put(w, colour);
         if (e.has_instant) {

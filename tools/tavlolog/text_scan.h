@@ -49,6 +49,41 @@ inline const unsigned char* plain_until(const unsigned char* p, const unsigned c
     return p;
 }
 
+// Copies the bytes from p that plain_until passes to w, advancing w: the
+// first byte that needs care (or end). Writes up to 16 bytes beyond w's end.
+inline const unsigned char* copy_plain(char*& w, const unsigned char* p, const unsigned char* end, bool json) {
+#if defined(__SSE2__)
+    const __m128i low = _mm_set1_epi8(0x1f), del = _mm_set1_epi8(0x7f);
+    const __m128i quote = _mm_set1_epi8('"'), backslash = _mm_set1_epi8('\\');
+    while (end - p >= 16) {
+        __m128i x = _mm_loadu_si128(reinterpret_cast<const __m128i*>(p));
+        _mm_storeu_si128(reinterpret_cast<__m128i*>(w), x);
+        __m128i good = _mm_and_si128(_mm_cmpgt_epi8(x, low), _mm_cmplt_epi8(x, del));
+        if (json)
+            good = _mm_andnot_si128(_mm_or_si128(_mm_cmpeq_epi8(x, quote), _mm_cmpeq_epi8(x, backslash)), good);
+        unsigned mask = static_cast<unsigned>(_mm_movemask_epi8(good));
+        if (mask != 0xffff) {
+            int n = __builtin_ctz(~mask);
+            w += n;
+            return p + n;
+        }
+        p += 16;
+        w += 16;
+    }
+    for (; p < end; p++) {
+        unsigned char c = *p;
+        if (c < 0x20 || c >= 0x7f || (json && (c == '"' || c == '\\'))) break;
+        *w++ = static_cast<char>(c);
+    }
+    return p;
+#else
+    const unsigned char* q = plain_until(p, end, json);
+    memcpy(w, p, static_cast<size_t>(q - p));
+    w += q - p;
+    return q;
+#endif
+}
+
 // Two decimal digits of v (below 100) at p.
 inline void put_digits(char* p, uint32_t v) {
     static const char kPairs[] =
