@@ -100,7 +100,7 @@ class JsonOutput : public Sink {
             source_[s].set(std::string(",\"source\":\"") + source_name(static_cast<Source>(s)) + "\"");
         for (int k = KIND_LINE; k <= KIND_MALFORMED; k++)
             kind_[k].set(std::string(",\"kind\":\"") + kind_name(static_cast<Kind>(k)) + "\",\"file\":");
-        file_.set("\"\"");
+        for (FileName& f : files_) f.text.set("\"\"");
     }
 
     // A section's entries name its texts from one place; another section
@@ -108,9 +108,15 @@ class JsonOutput : public Sink {
     void section(const SectionInfo&) override { fresh_ = true; }
 
     void entry(const Entry& e) override {
-        if (!same(e.file, file_name_)) {
-            file_name_.assign(e.file.data(), e.file.size());
-            file_.set(escaped(e.file));
+        // The lanes take turns: a few files' names kept written out.
+        const Written* file = nullptr;
+        for (size_t i = 0; i < kFiles && file == nullptr; i++)
+            if (same(e.file, files_[i].name)) file = &files_[i].text;
+        if (file == nullptr) {
+            FileName& f = files_[next_file_++ % kFiles];
+            f.name.assign(e.file.data(), e.file.size());
+            f.text.set(escaped(e.file));
+            file = &f.text;
         }
         if (fresh_ || e.run.data() != run_ || e.run.size() != run_size_ || e.boot_name.data() != boot_name_ ||
             e.boot_name.size() != boot_name_size_ || e.boot != boot_) {
@@ -126,7 +132,7 @@ class JsonOutput : public Sink {
         }
         // The longest form: the fixed fields, every byte of tag and message
         // escaped, and the room the copies may write beyond.
-        char* w = out_.reserve(512 + file_.size() + tail_.size() + 6 * (e.tag.size() + e.message.size()));
+        char* w = out_.reserve(512 + file->size() + tail_.size() + 6 * (e.tag.size() + e.message.size()));
         w = put(w, "{\"time\":");
         if (e.has_instant) {
             *w++ = '"';
@@ -172,7 +178,7 @@ class JsonOutput : public Sink {
         w = put(w, ",\"message\":");
         w = put_string(w, e.message);
         w = kind_[e.kind <= KIND_MALFORMED ? e.kind : 0].put(w);
-        w = file_.put(w);
+        w = file->put(w);
         w = put(w, ",\"offset\":");
         w = put_number(w, static_cast<int64_t>(e.offset));
         w = tail_.put(w);
@@ -191,8 +197,13 @@ class JsonOutput : public Sink {
     OutBuffer out_;
     TimeFormat time_;
     Written priority_[PRIO_VERBOSE + 2], source_[SRC_COUNT], kind_[KIND_MALFORMED + 1];
-    std::string file_name_;
-    Written file_, tail_;
+    static constexpr size_t kFiles = 8;
+    struct FileName {
+        std::string name;
+        Written text;
+    } files_[kFiles];
+    size_t next_file_ = 0;
+    Written tail_;
     const char* run_ = nullptr;
     const char* boot_name_ = nullptr;
     size_t run_size_ = 0, boot_name_size_ = 0;

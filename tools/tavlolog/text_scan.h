@@ -55,6 +55,7 @@ inline const unsigned char* copy_plain(char*& w, const unsigned char* p, const u
 #if defined(__SSE2__)
     const __m128i low = _mm_set1_epi8(0x1f), del = _mm_set1_epi8(0x7f);
     const __m128i quote = _mm_set1_epi8('"'), backslash = _mm_set1_epi8('\\');
+    const unsigned char* start = p;
     while (end - p >= 16) {
         __m128i x = _mm_loadu_si128(reinterpret_cast<const __m128i*>(p));
         _mm_storeu_si128(reinterpret_cast<__m128i*>(w), x);
@@ -69,6 +70,19 @@ inline const unsigned char* copy_plain(char*& w, const unsigned char* p, const u
         }
         p += 16;
         w += 16;
+    }
+    if (p != end && p - start >= 16) {
+        // The last 16 bytes, over some just copied as they are: copied again alike.
+        size_t back = static_cast<size_t>(16 - (end - p));
+        __m128i x = _mm_loadu_si128(reinterpret_cast<const __m128i*>(end - 16));
+        _mm_storeu_si128(reinterpret_cast<__m128i*>(w - back), x);
+        __m128i good = _mm_and_si128(_mm_cmpgt_epi8(x, low), _mm_cmplt_epi8(x, del));
+        if (json)
+            good = _mm_andnot_si128(_mm_or_si128(_mm_cmpeq_epi8(x, quote), _mm_cmpeq_epi8(x, backslash)), good);
+        unsigned mask = static_cast<unsigned>(_mm_movemask_epi8(good)) | ((1u << back) - 1);
+        size_t n = mask == 0xffff ? 16 : static_cast<size_t>(__builtin_ctz(~mask));
+        w += n - back;
+        return p + (n - back);
     }
     for (; p < end; p++) {
         unsigned char c = *p;
@@ -93,13 +107,15 @@ inline void put_digits(char* p, uint32_t v) {
     memcpy(p, kPairs + 2 * v, 2);
 }
 
-// Writes v in decimal at p, right-aligned in width: the end. At most 20 bytes
-// or width.
+// Writes v in decimal at p, right-aligned in width: the end.
 inline char* put_number(char* p, int64_t v, int width = 0) {
-    char text[24];
-    char* end = text + sizeof(text);
-    char* q = end;
     uint64_t u = v < 0 ? static_cast<uint64_t>(-(v + 1)) + 1 : static_cast<uint64_t>(v);
+    int len = 1;
+    for (uint64_t t = u; t >= 10; t /= 10) len++;
+    len += v < 0;
+    for (; len < width; width--) *p++ = ' ';
+    char* end = p + len;
+    char* q = end;
     while (u >= 100) {
         q -= 2;
         put_digits(q, static_cast<uint32_t>(u % 100));
@@ -112,13 +128,7 @@ inline char* put_number(char* p, int64_t v, int width = 0) {
         *--q = static_cast<char>('0' + u);
     }
     if (v < 0) *--q = '-';
-    int len = static_cast<int>(end - q);
-    if (len < width) {
-        memset(p, ' ', static_cast<size_t>(width - len));
-        p += width - len;
-    }
-    memcpy(p, q, static_cast<size_t>(len));
-    return p + len;
+    return end;
 }
 
 }  // namespace tavlolog
