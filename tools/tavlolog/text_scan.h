@@ -71,25 +71,28 @@ inline const unsigned char* copy_plain(char*& w, const unsigned char* p, const u
         p += 16;
         w += 16;
     }
-    if (p != end && p - start >= 16) {
+    if (p == end) return p;
+    size_t back = 0;
+    __m128i x;
+    if (p - start >= 16) {
         // The last 16 bytes, over some just copied as they are: copied again alike.
-        size_t back = static_cast<size_t>(16 - (end - p));
-        __m128i x = _mm_loadu_si128(reinterpret_cast<const __m128i*>(end - 16));
-        _mm_storeu_si128(reinterpret_cast<__m128i*>(w - back), x);
-        __m128i good = _mm_and_si128(_mm_cmpgt_epi8(x, low), _mm_cmplt_epi8(x, del));
-        if (json)
-            good = _mm_andnot_si128(_mm_or_si128(_mm_cmpeq_epi8(x, quote), _mm_cmpeq_epi8(x, backslash)), good);
-        unsigned mask = static_cast<unsigned>(_mm_movemask_epi8(good)) | ((1u << back) - 1);
-        size_t n = mask == 0xffff ? 16 : static_cast<size_t>(__builtin_ctz(~mask));
-        w += n - back;
-        return p + (n - back);
+        back = static_cast<size_t>(16 - (end - p));
+        x = _mm_loadu_si128(reinterpret_cast<const __m128i*>(end - 16));
+    } else {
+        // A short rest: through a block of its own, not byte by byte.
+        unsigned char rest[16] = {};
+        memcpy(rest, p, static_cast<size_t>(end - p));
+        x = _mm_loadu_si128(reinterpret_cast<const __m128i*>(rest));
     }
-    for (; p < end; p++) {
-        unsigned char c = *p;
-        if (c < 0x20 || c >= 0x7f || (json && (c == '"' || c == '\\'))) break;
-        *w++ = static_cast<char>(c);
-    }
-    return p;
+    _mm_storeu_si128(reinterpret_cast<__m128i*>(w - back), x);
+    __m128i good = _mm_and_si128(_mm_cmpgt_epi8(x, low), _mm_cmplt_epi8(x, del));
+    if (json) good = _mm_andnot_si128(_mm_or_si128(_mm_cmpeq_epi8(x, quote), _mm_cmpeq_epi8(x, backslash)), good);
+    // The bytes before p were passed already; the scan stops at end.
+    size_t rest = static_cast<size_t>(end - p);
+    unsigned mask = (static_cast<unsigned>(_mm_movemask_epi8(good)) | ((1u << back) - 1)) & ((1u << (back + rest)) - 1);
+    size_t n = static_cast<size_t>(__builtin_ctz(~mask)) - back;
+    w += n;
+    return p + n;
 #else
     const unsigned char* q = plain_until(p, end, json);
     memcpy(w, p, static_cast<size_t>(q - p));
