@@ -193,6 +193,12 @@ bool Lane::next() {
     h.entry.message = std::string_view(text + tag, message);
     h.entry.file = std::string_view(text + tag + message, h.entry.file.size());
     out_ = &h;
+    if (!heap_.empty()) {
+        // The next line out was read thousands of lines ago: fetch it meanwhile.
+        const Held& next = held_[heap_.front().order & 0xffff];
+        __builtin_prefetch(next.text.data());
+        __builtin_prefetch(next.text.data() + 64);
+    }
     return true;
 }
 
