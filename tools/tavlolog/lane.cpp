@@ -172,6 +172,8 @@ struct Later {
 
 bool Lane::next() {
     if (!reorders_) return read_one();
+    static_assert((kReorderEntries & (kReorderEntries - 1)) == 0, "the ring's size is a power of two");
+    constexpr size_t mask = kReorderEntries - 1;
     if (out_slot_ != UINT32_MAX) {
         // A rare long line gives its room back rather than keep it in a slot.
         if (held_[out_slot_].text.capacity() > 2048) std::string().swap(held_[out_slot_].text);
@@ -179,11 +181,18 @@ bool Lane::next() {
         out_slot_ = UINT32_MAX;
         out_ = &none_;
     }
-    while (heap_.size() < kReorderEntries && held_bytes_ < kReorderBytes && read_one()) hold();
-    if (heap_.empty()) return false;
-    std::pop_heap(heap_.begin(), heap_.end(), Later());
-    out_slot_ = static_cast<uint32_t>(heap_.back().order & 0xffff);
-    heap_.pop_back();
+    while (count_ + heap_.size() < kReorderEntries && held_bytes_ < kReorderBytes && read_one()) hold();
+    if (count_ > 0 && (heap_.empty() || !Later()(ring_[head_], heap_.front()))) {
+        out_slot_ = static_cast<uint32_t>(ring_[head_].order & 0xffff);
+        head_ = (head_ + 1) & mask;
+        count_--;
+    } else if (!heap_.empty()) {
+        std::pop_heap(heap_.begin(), heap_.end(), Later());
+        out_slot_ = static_cast<uint32_t>(heap_.back().order & 0xffff);
+        heap_.pop_back();
+    } else {
+        return false;
+    }
     Held& h = held_[out_slot_];
     size_t tag = h.entry.tag.size(), message = h.entry.message.size();
     held_bytes_ -= tag + message + kHeldCost;
@@ -193,9 +202,10 @@ bool Lane::next() {
     h.entry.message = std::string_view(text + tag, message);
     h.entry.file = std::string_view(text + tag + message, h.entry.file.size());
     out_ = &h;
-    if (!heap_.empty()) {
-        // The next line out was read thousands of lines ago: fetch it meanwhile.
-        const Held& next = held_[heap_.front().order & 0xffff];
+    // The lines next out were read thousands of lines ago: fetch them meanwhile.
+    if (count_ > 8) __builtin_prefetch(&held_[ring_[(head_ + 8) & mask].order & 0xffff]);
+    if (count_ > 0) {
+        const Held& next = held_[ring_[head_].order & 0xffff];
         __builtin_prefetch(next.text.data());
         __builtin_prefetch(next.text.data() + 64);
     }
@@ -204,9 +214,10 @@ bool Lane::next() {
 
 void Lane::hold() {
     static_assert(kReorderEntries < 0xffff, "a slot's number fits its record");
+    constexpr size_t mask = kReorderEntries - 1;
     if (held_.empty()) {
         held_.reserve(kReorderEntries + 1);
-        heap_.reserve(kReorderEntries);
+        ring_.reset(new Slot[kReorderEntries]);
     }
     uint32_t slot;
     if (free_.empty()) {
@@ -223,8 +234,14 @@ void Lane::hold() {
     h.text.append(entry_.message.data(), entry_.message.size());
     h.text.append(entry_.file.data(), entry_.file.size());
     held_bytes_ += entry_.tag.size() + entry_.message.size() + kHeldCost;
-    heap_.push_back(Slot{key_, arrivals_++ << 16 | slot});
-    std::push_heap(heap_.begin(), heap_.end(), Later());
+    Slot record{key_, arrivals_++ << 16 | slot};
+    if (count_ == 0 || ring_[(head_ + count_ - 1) & mask].key <= key_) {
+        ring_[(head_ + count_) & mask] = record;
+        count_++;
+    } else {
+        heap_.push_back(record);
+        std::push_heap(heap_.begin(), heap_.end(), Later());
+    }
 }
 
 bool Lane::read_one() {

@@ -116,10 +116,13 @@ class Lane {
     Entry entry_;
     int64_t key_ = INT64_MIN;
     // The reordering window: slots whose texts keep their room from line to
-    // line, and a heap of the small records that name them.
+    // line, and the small records that name them: those that came in order in
+    // a ring, the others in a heap; the next out is the earlier of their fronts.
     std::vector<Held> held_;
     std::vector<uint32_t> free_;
     std::vector<Slot> heap_;
+    std::unique_ptr<Slot[]> ring_;
+    size_t head_ = 0, count_ = 0;
     uint64_t arrivals_ = 0;
     size_t held_bytes_ = 0;
     uint32_t out_slot_ = UINT32_MAX;  // handed out: freed at the next call
