@@ -64,7 +64,7 @@ void civil_from_days(int64_t z, int* year, int* month, int* day) {
 
 bool parse_threadtime(std::string_view line, ParsedLine* out) {
     *out = ParsedLine();
-    if (line.substr(0, kBeginning.size()) == kBeginning) {
+    if (!line.empty() && line[0] == '-' && line.substr(0, kBeginning.size()) == kBeginning) {
         out->kind = KIND_MARKER;
         out->message = line;
         return true;
@@ -164,7 +164,7 @@ bool parse_kernel(std::string_view line, ParsedLine* out) {
 }
 
 bool parse_header(std::string_view line, std::string_view* zone) {
-    if (line.substr(0, kHeader.size()) != kHeader) return false;
+    if (line.empty() || line[0] != '-' || line.substr(0, kHeader.size()) != kHeader) return false;
     *zone = line.substr(kHeader.size());
     return true;
 }
