@@ -94,7 +94,13 @@ void write_type(const std::string& dir, const char* type, const std::vector<std:
         int64_t written = 0;
         while (written < per_piece) {
             buf.clear();
-            while (buf.size() < 65536) append_line(buf, type, start_ns + span_ns * line++ / lines_total, tags);
+            // In double: span_ns * line overflows 64 bits past a few hundred thousand lines.
+            while (buf.size() < 65536)
+                append_line(buf, type,
+                            start_ns + static_cast<int64_t>(static_cast<double>(span_ns) *
+                                                            static_cast<double>(line++) /
+                                                            static_cast<double>(lines_total)),
+                            tags);
             fwrite(buf.data(), 1, buf.size(), f);
             written += static_cast<int64_t>(buf.size());
         }

@@ -197,6 +197,13 @@ const Case kCases[] = {
      {},
      "K 2026-01-01T00:00:05.000Z kernel\nM 2026-01-01T00:00:05.000Z m: main\nR 2026-01-01T00:00:05.000Z r: radio\n"
      "E 2026-01-01T00:00:05.000Z ev: [1]\nB - bt text\n"},
+    {"MainLogsTwoBuffersArePutInOrder",
+     {{"APLog_2026_0101_000500/main_log",
+       H() + line("01-01 00:00:03.000", "I a       : c") + line("01-01 00:00:01.000", "I a       : a") +
+           line("01-01 00:00:02.000", "I a       : b1") + line("01-01 00:00:02.000", "I a       : b2")}},
+     {},
+     "M 2026-01-01T00:00:01.000Z a: a\nM 2026-01-01T00:00:02.000Z a: b1\nM 2026-01-01T00:00:02.000Z a: b2\n"
+     "M 2026-01-01T00:00:03.000Z a: c\n"},
     {"MalformedInputIsShownWhereItIs",
      {{"APLog_2026_0101_000500/main_log",
        H() + "--------- beginning of /dev/log/main\n" + line("01-01 00:00:01.000", "I a       : ok") +
@@ -255,6 +262,50 @@ TEST_P(TavlologRead, MergesAsWritten) {
 
 INSTANTIATE_TEST_SUITE_P(Of, TavlologRead, ::testing::ValuesIn(kCases),
                          [](const ::testing::TestParamInfo<Case>& i) { return std::string(i.param.name); });
+
+// The outputs' escaping, around the blocks in which plain text is passed.
+TEST(TavlologOutput, EscapesWhatATerminalOrJsonCannotTake) {
+    const std::string a15(15, 'a'), a16(16, 'a'), a20(20, 'a');
+    const struct {
+        std::string message, text, json;
+    } rows[] = {
+        {a15, a15, a15},
+        {a16 + "b", a16 + "b", a16 + "b"},
+        {a15 + "\x01", a15 + "\\x01", a15 + "\\u0001"},
+        {a16 + "\"" + "bbbbb", a16 + "\"bbbbb", a16 + "\\\"bbbbb"},
+        {a20 + "\x1b", a20 + "\\x1b", a20 + "\\u001b"},
+        {"\x7f" + a20, "\\x7f" + a20, "\\u007f" + a20},
+        {"aaaaaaaaaaaaaa\xc3\xa9" + a15, "aaaaaaaaaaaaaa\xc3\xa9" + a15, "aaaaaaaaaaaaaa\xc3\xa9" + a15},
+        {a15 + "\xc3", a15 + "\\xc3", a15 + "\\u00c3"},
+        {"tab\t" + a20 + "\\\n", "tab\t" + a20 + "\\\\x0a", "tab\\t" + a20 + "\\\\\\n"},
+    };
+    for (const auto& row : rows) {
+        Entry e{};
+        e.instant_ns = 1767225600LL * 1000000000;
+        e.has_instant = true;
+        e.source = SRC_MAIN;
+        e.priority = 6;
+        e.pid = 100;
+        e.tid = 101;
+        e.tag = "tag";
+        e.message = row.message;
+        e.file = "main_log";
+        e.run = "APLog_2026_0101_000500";
+        for (bool json : {false, true}) {
+            char* text = nullptr;
+            size_t size = 0;
+            FILE* out = open_memstream(&text, &size);
+            std::unique_ptr<Sink> sink = json ? make_json_output(out) : make_text_output(out, false);
+            sink->entry(e);
+            sink.reset();
+            fclose(out);
+            std::string got(text, size);
+            free(text);
+            std::string want = json ? "\"message\":\"" + row.json + "\"," : "  100   101 tag: " + row.text + "\n";
+            EXPECT_NE(std::string::npos, got.find(want)) << got;
+        }
+    }
+}
 
 // --follow on a folder the test writes into: a rotation that cuts a line, then
 // the run's end and the next run folder beside it.

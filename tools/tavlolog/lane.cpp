@@ -8,6 +8,7 @@
 #include <algorithm>
 #include <cstring>
 
+#include "tools/tavlolog/text_scan.h"
 #include "tools/tavlolog/warnings.h"
 
 namespace tavlolog {
@@ -40,11 +41,9 @@ bool printable(std::string_view s) {
     const unsigned char* p = reinterpret_cast<const unsigned char*>(s.data());
     const unsigned char* end = p + s.size();
     while (p < end) {
+        p = plain_until(p, end, false);
+        if (p == end) break;
         unsigned char c = *p;
-        if (c >= 0x20 && c < 0x7f) {
-            p++;
-            continue;
-        }
         if (c == '\t' || (c == '\r' && p + 1 == end)) {
             p++;
             continue;
@@ -163,34 +162,86 @@ Lane::Read Lane::next_line(std::string_view* line, uint64_t* offset, const std::
 }
 
 namespace {
-// The heap's order: the latest on top of std::*_heap is the earliest instant.
-bool later(const Lane::Held& a, const Lane::Held& b) { return a.key != b.key ? a.key > b.key : a.seq > b.seq; }
+// std::*_heap keep the greatest on top: the latest is the earliest instant.
+struct Later {
+    bool operator()(const Lane::Slot& a, const Lane::Slot& b) const {
+        return a.key != b.key ? a.key > b.key : a.order > b.order;
+    }
+};
 }  // namespace
 
 bool Lane::next() {
     if (!reorders_) return read_one();
-    while (heap_.size() < kReorderEntries && heap_bytes_ < kReorderBytes && read_one()) {
-        Held h;
-        h.entry = entry_;
-        h.key = key_;
-        h.seq = seq_++;
-        h.tag.assign(entry_.tag.data(), entry_.tag.size());
-        h.message.assign(entry_.message.data(), entry_.message.size());
-        h.file.assign(entry_.file.data(), entry_.file.size());
-        heap_bytes_ += h.message.size() + h.tag.size() + sizeof(Held);
-        heap_.push_back(std::move(h));
-        std::push_heap(heap_.begin(), heap_.end(), later);
+    static_assert((kReorderEntries & (kReorderEntries - 1)) == 0, "the ring's size is a power of two");
+    constexpr size_t mask = kReorderEntries - 1;
+    if (out_slot_ != UINT32_MAX) {
+        // A rare long line gives its room back rather than keep it in a slot.
+        if (held_[out_slot_].text.capacity() > 2048) std::string().swap(held_[out_slot_].text);
+        free_.push_back(out_slot_);
+        out_slot_ = UINT32_MAX;
+        out_ = &none_;
     }
-    if (heap_.empty()) return false;
-    std::pop_heap(heap_.begin(), heap_.end(), later);
-    out_ = std::move(heap_.back());
-    heap_.pop_back();
-    heap_bytes_ -= out_.message.size() + out_.tag.size() + sizeof(Held);
-    // The views point into the copies, which stay until the next call.
-    out_.entry.tag = out_.tag;
-    out_.entry.message = out_.message;
-    out_.entry.file = out_.file;
+    while (count_ + heap_.size() < kReorderEntries && held_bytes_ < kReorderBytes && read_one()) hold();
+    if (count_ > 0 && (heap_.empty() || !Later()(ring_[head_], heap_.front()))) {
+        out_slot_ = static_cast<uint32_t>(ring_[head_].order & 0xffff);
+        head_ = (head_ + 1) & mask;
+        count_--;
+    } else if (!heap_.empty()) {
+        std::pop_heap(heap_.begin(), heap_.end(), Later());
+        out_slot_ = static_cast<uint32_t>(heap_.back().order & 0xffff);
+        heap_.pop_back();
+    } else {
+        return false;
+    }
+    Held& h = held_[out_slot_];
+    size_t tag = h.entry.tag.size(), message = h.entry.message.size();
+    held_bytes_ -= tag + message + kHeldCost;
+    // The views point into the copy, which stays until the next call.
+    const char* text = h.text.data();
+    h.entry.tag = std::string_view(text, tag);
+    h.entry.message = std::string_view(text + tag, message);
+    h.entry.file = std::string_view(text + tag + message, h.entry.file.size());
+    out_ = &h;
+    // The lines next out were read thousands of lines ago: fetch them meanwhile.
+    if (count_ > 8) __builtin_prefetch(&held_[ring_[(head_ + 8) & mask].order & 0xffff]);
+    if (count_ > 0) {
+        const Held& next = held_[ring_[head_].order & 0xffff];
+        __builtin_prefetch(next.text.data());
+        __builtin_prefetch(next.text.data() + 64);
+    }
     return true;
+}
+
+void Lane::hold() {
+    static_assert(kReorderEntries < 0xffff, "a slot's number fits its record");
+    constexpr size_t mask = kReorderEntries - 1;
+    if (held_.empty()) {
+        held_.reserve(kReorderEntries + 1);
+        ring_.reset(new Slot[kReorderEntries]);
+    }
+    uint32_t slot;
+    if (free_.empty()) {
+        slot = static_cast<uint32_t>(held_.size());
+        held_.emplace_back();
+    } else {
+        slot = free_.back();
+        free_.pop_back();
+    }
+    Held& h = held_[slot];
+    h.entry = entry_;
+    h.key = key_;
+    h.text.assign(entry_.tag.data(), entry_.tag.size());
+    h.text.append(entry_.message.data(), entry_.message.size());
+    h.text.append(entry_.file.data(), entry_.file.size());
+    held_bytes_ += entry_.tag.size() + entry_.message.size() + kHeldCost;
+    Slot record{key_, arrivals_++ << 16 | slot};
+    if (count_ == 0 || ring_[(head_ + count_ - 1) & mask].key <= key_) {
+        ring_[(head_ + count_) & mask] = record;
+        count_++;
+    } else {
+        heap_.push_back(record);
+        std::push_heap(heap_.begin(), heap_.end(), Later());
+    }
 }
 
 bool Lane::read_one() {

@@ -42,12 +42,12 @@ class Lane {
     // Reads the next entry: true with it in entry(), false when the lane has
     // nothing more (for now, while following).
     bool next();
-    const Entry& entry() const { return reorders_ ? out_.entry : entry_; }
+    const Entry& entry() const { return reorders_ ? out_->entry : entry_; }
     // The lane's entries carry no comparable instant (Bluetooth bytes, kernel
     // lines without their boot's start): merged after the timed ones.
     bool untimed() const { return untimed_; }
     // The merge order: the instant, or that of the line before.
-    int64_t key() const { return reorders_ ? out_.key : key_; }
+    int64_t key() const { return reorders_ ? out_->key : key_; }
     // From now on the run's file may grow: its end is not the end of the lane.
     void follow();
     // Following: picks up a rotation (the renamed file is read to its end
@@ -60,12 +60,20 @@ class Lane {
     static constexpr size_t kReorderEntries = 4096;
     static constexpr size_t kReorderBytes = 4 * 1024 * 1024;
 
-    // A line held for reordering, with its own copies of the texts.
+    // A held line's bookkeeping as counted against kReorderBytes.
+    static constexpr size_t kHeldCost = 256;
+
+    // A held line's place in the reordering window: by (key, arrival).
+    struct Slot {
+        int64_t key;
+        uint64_t order;  // arrival << 16 | the held slot's number
+    };
+
+    // A line held for reordering, with its own copy of its texts.
     struct Held {
         Entry entry;
         int64_t key = 0;
-        uint64_t seq = 0;
-        std::string tag, message, file;
+        std::string text;  // tag, message and file name, one after the other
     };
 
   private:
@@ -78,6 +86,7 @@ class Lane {
     void kernel_entry(const ParsedLine& p);
     void bt_entry(std::string_view line, uint64_t offset);
     void inherit();
+    void hold();
     void set_zone(std::string_view name);
     int year_of(int month, int day);
 
@@ -106,10 +115,19 @@ class Lane {
     bool reorders_ = false;
     Entry entry_;
     int64_t key_ = INT64_MIN;
-    std::vector<Held> heap_;  // min-heap by (key, seq)
-    size_t heap_bytes_ = 0;
-    uint64_t seq_ = 0;
-    Held out_;
+    // The reordering window: slots whose texts keep their room from line to
+    // line, and the small records that name them: those that came in order in
+    // a ring, the others in a heap; the next out is the earlier of their fronts.
+    std::vector<Held> held_;
+    std::vector<uint32_t> free_;
+    std::vector<Slot> heap_;
+    std::unique_ptr<Slot[]> ring_;
+    size_t head_ = 0, count_ = 0;
+    uint64_t arrivals_ = 0;
+    size_t held_bytes_ = 0;
+    uint32_t out_slot_ = UINT32_MAX;  // handed out: freed at the next call
+    Held none_;
+    const Held* out_ = &none_;
     bool has_last_ = false;
     int64_t last_instant_ = 0;
     int32_t last_offset_ = 0;

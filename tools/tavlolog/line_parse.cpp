@@ -64,7 +64,7 @@ void civil_from_days(int64_t z, int* year, int* month, int* day) {
 
 bool parse_threadtime(std::string_view line, ParsedLine* out) {
     *out = ParsedLine();
-    if (line.substr(0, kBeginning.size()) == kBeginning) {
+    if (!line.empty() && line[0] == '-' && line.substr(0, kBeginning.size()) == kBeginning) {
         out->kind = KIND_MARKER;
         out->message = line;
         return true;
@@ -106,10 +106,13 @@ bool parse_threadtime(std::string_view line, ParsedLine* out) {
     if (letter < 'A' || letter > 'Z') return false;
     p += 3;
     // The tag is padded to 8 and followed by ": "; a tag may hold spaces.
-    const void* colon = memmem(p, static_cast<size_t>(end - p), ": ", 2);
+    const char* colon = p;
+    while ((colon = static_cast<const char*>(memchr(colon, ':', static_cast<size_t>(end - colon)))) != nullptr &&
+           (colon + 1 == end || colon[1] != ' '))
+        colon++;
     const char* tag_end;
     if (colon != nullptr) {
-        tag_end = static_cast<const char*>(colon);
+        tag_end = colon;
         out->message = std::string_view(tag_end + 2, static_cast<size_t>(end - tag_end - 2));
     } else if (end - p >= 1 && end[-1] == ':') {
         tag_end = end - 1;  // an empty message
@@ -161,7 +164,7 @@ bool parse_kernel(std::string_view line, ParsedLine* out) {
 }
 
 bool parse_header(std::string_view line, std::string_view* zone) {
-    if (line.substr(0, kHeader.size()) != kHeader) return false;
+    if (line.empty() || line[0] != '-' || line.substr(0, kHeader.size()) != kHeader) return false;
     *zone = line.substr(kHeader.size());
     return true;
 }

@@ -11,30 +11,42 @@
 namespace tavlolog {
 
 // Buffered writing to a stream; the outputs format into it by hand, which
-// keeps a merge of a large folder bound by the disk, not by printf.
+// keeps a merge of a large folder bound by the disk, not by printf. Each
+// entry asks for room for its longest form, writes through a pointer and
+// commits; the stream gets one write per kSize bytes.
 class OutBuffer {
   public:
-    explicit OutBuffer(FILE* out) : out_(out) { buf_.reserve(kSize + 4096); }
+    explicit OutBuffer(FILE* out) : out_(out), room_(kSize + kSlack), buf_(new char[room_]) {}
     ~OutBuffer() { flush(); }
-    std::string& text() { return buf_; }
-    void maybe_flush() {
-        if (buf_.size() >= kSize) flush();
+    // A pointer with room for n bytes, valid until commit.
+    char* reserve(size_t n) {
+        if (room_ - len_ < n) make_room(n);
+        return buf_.get() + len_;
     }
+    void commit(char* end) {
+        len_ = static_cast<size_t>(end - buf_.get());
+        if (len_ >= kSize) flush();
+    }
+    void append(const std::string& s);
     void flush();
     bool failed() const { return failed_; }
 
   private:
-    static constexpr size_t kSize = 1 << 20;
+    static constexpr size_t kSize = 256 * 1024;
+    static constexpr size_t kSlack = 64 * 1024;  // an entry that starts just before kSize
+    void make_room(size_t n);
     FILE* out_;
-    std::string buf_;
+    size_t room_, len_ = 0;
+    std::unique_ptr<char[]> buf_;
     bool failed_ = false;
 };
 
 // "2026-03-04 07:06:49.123000" in the entry's own zone, cached per second.
 class TimeFormat {
   public:
-    // 26 characters: date, time, microseconds (separator ' ' or 'T').
+    // 20 + fraction_digits characters: date, time, fraction (separator ' ' or 'T').
     void local(std::string& out, int64_t instant_ns, int32_t offset_s, char separator, int fraction_digits);
+    char* local(char* out, int64_t instant_ns, int32_t offset_s, char separator, int fraction_digits);
 
   private:
     int64_t cached_s_ = INT64_MIN;

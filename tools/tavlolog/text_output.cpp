@@ -12,29 +12,44 @@ namespace {
 
 constexpr int kTimeWidth = 26;
 
-// Appends s with control bytes and broken UTF-8 shown as \xNN.
-void append_escaped(std::string& out, std::string_view s) {
+// Writes s with control bytes and broken UTF-8 shown as \xNN (at most four
+// bytes for each of s, and 16 of room beyond).
+char* put_escaped(char* w, std::string_view s) {
     const unsigned char* p = reinterpret_cast<const unsigned char*>(s.data());
     const unsigned char* end = p + s.size();
-    const unsigned char* plain = p;
     static const char kHex[] = "0123456789abcdef";
     while (p < end) {
-        p = plain_until(p, end, false);
+        p = copy_plain(w, p, end, false);
         if (p == end) break;
         unsigned char c = *p;
         int more = c >= 0xf0 && c < 0xf5 ? 3 : c >= 0xe0 && c < 0xf0 ? 2 : c >= 0xc2 && c < 0xe0 ? 1 : -1;
         bool whole = more > 0 && end - p > more;
         for (int i = 1; whole && i <= more; i++) whole = (p[i] & 0xc0) == 0x80;
         if (whole || c == '\t') {
-            p += whole ? more + 1 : 1;
+            int n = whole ? more + 1 : 1;
+            for (int i = 0; i < n; i++) *w++ = static_cast<char>(*p++);
             continue;
         }
-        out.append(reinterpret_cast<const char*>(plain), static_cast<size_t>(p - plain));
-        char esc[4] = {'\\', 'x', kHex[c >> 4], kHex[c & 15]};
-        out.append(esc, 4);
-        plain = ++p;
+        w[0] = '\\';
+        w[1] = 'x';
+        w[2] = kHex[c >> 4];
+        w[3] = kHex[c & 15];
+        w += 4;
+        p++;
     }
-    out.append(reinterpret_cast<const char*>(plain), static_cast<size_t>(end - plain));
+    return w;
+}
+
+template <size_t N>
+char* put(char* w, const char (&text)[N]) {
+    memcpy(w, text, N - 1);
+    return w + N - 1;
+}
+
+char* put(char* w, const char* text) {
+    size_t n = strlen(text);
+    memcpy(w, text, n);
+    return w + n;
 }
 
 const char* colour_of(const Entry& e) {
@@ -59,65 +74,71 @@ class TextOutput : public Sink {
     TextOutput(FILE* out, bool colour) : out_(out), colour_(colour) {}
 
     void section(const SectionInfo& s) override {
-        std::string& t = out_.text();
-        t += "-- ";
+        std::string t = "-- ";
         if (s.boot == 0)
             t += "run " + s.run;
         else
             t += "held boot " + std::to_string(s.boot) + " \"" + s.name + "\" of " + s.run;
         t += " --\n";
+        out_.append(t);
     }
 
     void entry(const Entry& e) override {
-        std::string& t = out_.text();
+        // The longest form: colours, time, columns, the file, every byte escaped,
+        // and the room a copy may write beyond.
+        char* w = out_.reserve(256 + e.file.size() + 4 * (e.tag.size() + e.message.size()));
         const char* colour = colour_ ? colour_of(e) : nullptr;
-        if (colour != nullptr) t += colour;
+        if (colour != nullptr) w = put(w, colour);
         if (e.has_instant) {
-            time_.local(t, e.instant_ns, e.utc_offset_s, ' ', 6);
+            w = time_.local(w, e.instant_ns, e.utc_offset_s, ' ', 6);
         } else if (e.source == SRC_KERNEL && (e.uptime_ns >= 0 || (e.inherited && e.instant_ns > 0))) {
             int64_t up = e.uptime_ns >= 0 ? e.uptime_ns : e.instant_ns;
             char text[48];
             int n = snprintf(text, sizeof(text), "boot +%lld.%06lld", static_cast<long long>(up / 1000000000),
                              static_cast<long long>(up % 1000000000 / 1000));
-            t.append(text, static_cast<size_t>(n));
-            if (n < kTimeWidth) t.append(static_cast<size_t>(kTimeWidth - n), ' ');
+            memcpy(w, text, static_cast<size_t>(n));
+            w += n;
+            for (; n < kTimeWidth; n++) *w++ = ' ';
         } else {
-            t.append(kTimeWidth, ' ');
+            memset(w, ' ', kTimeWidth);
+            w += kTimeWidth;
         }
-        t += ' ';
-        t += SOURCE_LETTER[e.source];
-        t += ' ';
-        t += e.priority == PRIO_NONE ? '-' : e.source == SRC_KERNEL ? static_cast<char>('0' + e.priority)
-                                                                      : priority_letter(e.priority);
-        t += ' ';
+        w[0] = ' ';
+        w[1] = SOURCE_LETTER[e.source];
+        w[2] = ' ';
+        w[3] = e.priority == PRIO_NONE ? '-' : e.source == SRC_KERNEL ? static_cast<char>('0' + e.priority)
+                                                                        : priority_letter(e.priority);
+        w[4] = ' ';
+        w += 5;
         if (e.pid >= 0) {
-            append_number(t, e.pid, 5);
-            t += ' ';
-            append_number(t, e.tid, 5);
-            t += ' ';
+            w = put_number(w, e.pid, 5);
+            *w++ = ' ';
+            w = put_number(w, e.tid, 5);
+            *w++ = ' ';
         }
         switch (e.kind) {
             case KIND_LINE:
                 if (e.source != SRC_KERNEL && e.source != SRC_BT) {
-                    append_escaped(t, e.tag);
-                    t += ": ";
+                    w = put_escaped(w, e.tag);
+                    w = put(w, ": ");
                 }
                 break;
-            case KIND_NOTE: t += "== "; break;
+            case KIND_NOTE: w = put(w, "== "); break;
             case KIND_MALFORMED:
             case KIND_HEX:
-                t += e.kind == KIND_HEX ? "[" : "[malformed ";
-                t.append(e.file.data(), e.file.size());
-                t += '@';
-                append_number(t, static_cast<int64_t>(e.offset));
-                t += "] ";
+                w = e.kind == KIND_HEX ? put(w, "[") : put(w, "[malformed ");
+                memcpy(w, e.file.data(), e.file.size());
+                w += e.file.size();
+                *w++ = '@';
+                w = put_number(w, static_cast<int64_t>(e.offset));
+                w = put(w, "] ");
                 break;
             default: break;
         }
-        append_escaped(t, e.message);
-        if (colour != nullptr) t += "\033[0m";
-        t += '\n';
-        out_.maybe_flush();
+        w = put_escaped(w, e.message);
+        if (colour != nullptr) w = put(w, "\033[0m");
+        *w++ = '\n';
+        out_.commit(w);
     }
 
     void idle() override { out_.flush(); }

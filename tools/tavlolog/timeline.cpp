@@ -85,19 +85,22 @@ class Merger {
     void drain(Lanes& lanes) {
         size_t n = lanes.size();
         has_.assign(n, 0);
-        std::vector<char> done(n, 0);
+        timed_.assign(n, 0);
+        for (size_t i = 0; i < n; i++) {
+            has_[i] = lanes[i]->next();
+            timed_[i] = !lanes[i]->untimed();
+        }
         for (;;) {
-            for (size_t i = 0; i < n; i++) {
-                if (!has_[i] && !done[i]) {
-                    has_[i] = lanes[i]->next();
-                    done[i] = !has_[i];
-                }
-            }
             int best = -1;
+            int64_t best_key = 0;
             for (size_t i = 0; i < n; i++) {
-                if (!has_[i] || lanes[i]->untimed()) continue;
+                if (!has_[i] || !timed_[i]) continue;
                 // Strictly earlier only: equal instants keep the order of the run's files.
-                if (best < 0 || lanes[i]->key() < lanes[best]->key()) best = static_cast<int>(i);
+                int64_t key = lanes[i]->key();
+                if (best < 0 || key < best_key) {
+                    best = static_cast<int>(i);
+                    best_key = key;
+                }
             }
             for (size_t i = 0; i < n && best < 0; i++)
                 if (has_[i]) best = static_cast<int>(i);
@@ -108,14 +111,15 @@ class Merger {
                 announced_ = true;
                 sink_->entry(e);
             }
-            has_[best] = 0;
+            // A lane that has nothing more is not asked again in this pass.
+            has_[best] = lanes[best]->next();
         }
     }
 
   private:
     const Filter& filter_;
     Sink* sink_;
-    std::vector<char> has_;
+    std::vector<char> has_, timed_;
     SectionInfo section_;
     bool announced_ = true;
 };
