@@ -101,23 +101,31 @@ class TransistTest : public ::testing::Test {
     bool running_ = false;
 };
 
+// With the default node size and with the smallest one accepted, which is
+// below what the reader takes in one read.
 TEST_F(TransistTest, EveryByteSentBeforeTheStopIsInTheFile) {
-    start();
-    std::string data;
-    for (int i = 0; i < 1 << 20; i++) data += static_cast<char>((i * 7 + i / 251) & 0xff);
-    stream_log('K', data);
-    // The reader cannot queue a chunk now, so these bytes are still in the
-    // socket when the stop begins: the stop itself must collect them.
-    pthread_mutex_lock(&queue_lock);
-    std::string tail = numbered_lines('M', 32768);
-    stream_log('M', tail);
-    stop_requested = true;
-    pthread_mutex_unlock(&queue_lock);
-    stop();
-    EXPECT_TRUE(log("kernel_log") == kHeader + data);
-    EXPECT_TRUE(log("main_log") == kHeader + tail);
-    EXPECT_EQ(log("bt_log"), kHeader);
-    for (const LogFile& entry : log_files) EXPECT_TRUE(entry.fd == -1 && entry.sock == -1);
+    for (const char* node_size : {"65535", "4095"}) {
+        SCOPED_TRACE(node_size);
+        ASSERT_EQ(property_set("debug.TQ.buffersize", node_size), 0);
+        ASSERT_EQ(system("rm -rf /data/run && mkdir /data/run"), 0);
+        start();
+        std::string data;
+        for (int i = 0; i < 1 << 20; i++) data += static_cast<char>((i * 7 + i / 251) & 0xff);
+        stream_log('K', data);
+        // The reader cannot queue a chunk now, so these bytes are still in the
+        // socket when the stop begins: the stop itself must collect them.
+        pthread_mutex_lock(&queue_lock);
+        std::string tail = numbered_lines('M', 32768);
+        stream_log('M', tail);
+        stop_requested = true;
+        pthread_mutex_unlock(&queue_lock);
+        stop();
+        EXPECT_TRUE(log("kernel_log") == kHeader + data);
+        EXPECT_TRUE(log("main_log") == kHeader + tail);
+        EXPECT_EQ(log("bt_log"), kHeader);
+        for (const LogFile& entry : log_files) EXPECT_TRUE(entry.fd == -1 && entry.sock == -1);
+    }
+    ASSERT_EQ(property_set("debug.TQ.buffersize", ""), 0);
 }
 
 // A connection without a log type holds up only the connections accepted after it (they may be

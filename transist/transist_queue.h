@@ -7,8 +7,12 @@
 
 #include "common/log_types.h"
 
-// Largest chunk the reader takes from a connection in one read.
+// Smallest node block (debug.TQ.buffersize below it is not accepted).
 constexpr int CHUNK_MAX = 4095;
+// Largest chunk the reader takes from a connection in one read (and at most
+// a node block): a read costs a system call and a turn of queue_lock, and a
+// stream of line-sized messages fills it many messages at a time.
+constexpr int READ_MAX = 16384;
 // Node block size when debug.TQ.buffersize is unset or unusable.
 constexpr int DEFAULT_CAPACITY = 65535;
 // Largest node block we accept from debug.TQ.buffersize; bigger values only

@@ -100,8 +100,9 @@ static void queue_chunk(int type, const char* data, int n) {
 }
 
 int read_log_message(int type, int fd, int* taken) {
-    char buf[CHUNK_MAX + 1];
-    ssize_t n = read(fd, buf, CHUNK_MAX);
+    char buf[READ_MAX];
+    int room = transist_capacity < READ_MAX ? transist_capacity : READ_MAX;
+    ssize_t n = read(fd, buf, static_cast<size_t>(room));
     if (taken != nullptr) *taken = n > 0 ? static_cast<int>(n) : 0;
     if (n < 0) {
         int err = errno;
@@ -139,7 +140,7 @@ static bool read_available(int type, int max_chunks) {
             return false;
         }
         // A short read emptied the connection: no read for EAGAIN.
-        if (taken < CHUNK_MAX) return true;
+        if (taken < READ_MAX && taken < transist_capacity) return true;
     }
     return true;
 }
