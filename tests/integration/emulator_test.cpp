@@ -1,5 +1,5 @@
 // The emulated phone itself: its tools, boot options and isolation, restart,
-// reboot and power-off, the kernel-log FIFO and the rights of the daemon's identity.
+// reboot and power-off, the kernel log and the rights of the daemon's identity.
 #include <dirent.h>
 #include <limits.h>
 #include <signal.h>
@@ -12,10 +12,10 @@
 
 namespace {
 
-// The daemon's identity after start-up.
+// The daemon's identity after start-up, which keeps CAP_SYSLOG for the kernel log.
 std::vector<std::string> as_daemon(const std::string& command) {
     return {"setpriv", "--reuid", "2000", "--regid", "1000", "--groups", "1000,1001,1007,1015,9998,2001,1028,1023",
-            "--", "sh", "-c", command};
+            "--inh-caps", "+syslog", "--ambient-caps", "+syslog", "--", "sh", "-c", command};
 }
 
 std::string read_link(const std::string& path) {
@@ -89,15 +89,20 @@ TEST(Emulator, DaemonRestartsRebootKeepsPersistentStateAndPowerOffLeavesNothing)
     EXPECT_NE(0, phone.exec({"true"}));
 }
 
-TEST(Emulator, KmsgCarriesHostBytesAndTheDaemonsIdentityWritesOnlyWhereItMust) {
+TEST(Emulator, KmsgHandsOutWholeLinesAndTheDaemonsIdentityReachesOnlyWhatItMust) {
     EmuPhone phone;
     ASSERT_TRUE(phone.boot());
     std::string out;
     EXPECT_EQ(0, phone.exec({"stat", "-c", "%F %a %u %g", "/proc/kmsg"}, &out));
-    EXPECT_EQ("fifo 440 0 1007\n", out);
-    ASSERT_TRUE(phone.feed("kmsg", "<6>[    1.000000] first line\n"));
-    EXPECT_EQ(0, phone.exec(as_daemon("head -c 29 /proc/kmsg"), &out));
-    EXPECT_EQ("<6>[    1.000000] first line\n", out);
+    EXPECT_EQ("regular empty file 440 0 1000\n", out);
+    // Reads of 255 bytes, as the kernel collector's, each by a reader of its
+    // own: whole lines while they fit, a longer line in pieces, and what one
+    // reader took no other sees.
+    const std::string a = "<6>" + std::string(96, 'a') + "\n";
+    ASSERT_TRUE(phone.feed("kmsg", a + a + a + "<6>" + std::string(296, 'b') + "\n<6>end of lines\n"));
+    EXPECT_EQ(0, phone.exec(as_daemon("for i in 1 2 3 4; do dd if=/proc/kmsg bs=255 count=1 2>/dev/null | wc -c; done; "
+                                      "dd if=/proc/kmsg bs=255 count=1 iflag=nonblock 2>&1 | grep -c unavailable"), &out));
+    EXPECT_EQ("200\n100\n255\n61\n1\n", out);
     // More than a pipe holds goes in without a reader, unchanged.
     std::string burst;
     for (int i = 0; burst.size() < 200000; i++) burst += "<6>line " + std::to_string(i) + "\n";
@@ -120,6 +125,8 @@ TEST(Emulator, KmsgCarriesHostBytesAndTheDaemonsIdentityWritesOnlyWhereItMust) {
         {"ls /data/property", false},
         {"touch /system/etc/probe", false},
         {"echo 1 > /sys/class/BOOT/BOOT/boot/boot_mode", false},
+        {"exec 3</proc/kmsg", true},
+        {"setpriv --ambient-caps -syslog -- sh -c 'exec 3</proc/kmsg'", false},  // without CAP_SYSLOG
     };
     ASSERT_EQ(0, phone.exec({"setprop", "debug.emu.by_root", "root"}));
     for (const auto& c : cases) EXPECT_EQ(c.allowed, phone.exec(as_daemon(c.command)) == 0) << c.command;

@@ -123,9 +123,10 @@ TEST(LogRun, StopInASteadyStreamLosesAndRepeatsNothing) {
     EXPECT_EQ(0, stream.compare(0, first_body.size(), first_body));
     EXPECT_GE(first_body.size(), sent_before_stop);
 
-    // The rest waits in the kernel log for the next run. A FIFO (unlike the
-    // kernel's log) ends a read anywhere: the first file may end inside a line
-    // that the next one completes. In the same second the next run reuses the folder.
+    // Each read of the kernel log is whole lines, so the first file ends at a
+    // line's end; the rest waits in the kernel log for the next run. In the
+    // same second the next run reuses the folder.
+    EXPECT_TRUE(!first_body.empty() && first_body.back() == '\n') << "the first file ends inside a line";
     ASSERT_TRUE(ctl(phone, "start"));
     std::string second = run_folder(phone) + "kernel_log";
     size_t skip = second == first ? first_file.size() : 0;
