@@ -287,7 +287,8 @@ static void start_kernel_log() {
 }
 
 // The logger devices, each of EMU_LOGGER_SIZE bytes (default 256 KiB), without
-// /dev/log/system when EMU_NO_SYSTEM_LOG=1. emu_logger returns once they serve.
+// /dev/log/system when EMU_NO_SYSTEM_LOG=1, stamping entries to the nanosecond
+// when EMU_LOGGER_FINE_CLOCK=1. emu_logger returns once they serve.
 static void start_logger_devices() {
     prepare_dir("/dev/log", 0755, AID_ROOT, AID_ROOT);
     const char* size = getenv("EMU_LOGGER_SIZE");
@@ -298,6 +299,7 @@ static void start_logger_devices() {
         argv[argc++] = size;
     }
     if (boot_flag("EMU_NO_SYSTEM_LOG")) argv[argc++] = "--no-system";
+    if (boot_flag("EMU_LOGGER_FINE_CLOCK")) argv[argc++] = "--fine-clock";
     argv[argc++] = "/dev/log";
     argv[argc] = nullptr;
     if (run_tool(argv) != 0) init_log("the logger devices do not serve (see console.log)");

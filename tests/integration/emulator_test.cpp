@@ -3,6 +3,7 @@
 #include <dirent.h>
 #include <limits.h>
 #include <signal.h>
+#include <stdlib.h>
 #include <unistd.h>
 
 #include <fstream>
@@ -33,12 +34,21 @@ int processes_in_pid_namespace(const std::string& ns_link) {
     return n;
 }
 
+// The nanoseconds of the oldest entry of /dev/log/main (-1 when none).
+long first_entry_nsec(EmuPhone& phone) {
+    std::string out;
+    phone.exec({"sh", "-c", "dd if=/dev/log/main bs=5120 count=1 iflag=nonblock 2>/dev/null | od -An -tu4 -j16 -N4"}, &out);
+    return out.empty() ? -1 : atol(out.c_str());
+}
+
 // The phone with the default options has the system log and the Bluetooth
-// service; the other has neither, and does not see the first one's socket.
+// service, and stamps log entries to the phone kernel's 10-ms tick; the other
+// has neither service, stamps to the nanosecond, and does not see the first
+// one's socket.
 TEST(Emulator, TwoPhonesRunTheirToolsWithTheirOwnOptionsAndDoNotSeeEachOther) {
     EmuPhone a, b;
     ASSERT_TRUE(a.boot());
-    ASSERT_TRUE(b.boot({"--no-system-log", "--no-btlog", "--logger-size", "4"}));
+    ASSERT_TRUE(b.boot({"--no-system-log", "--no-btlog", "--logger-size", "4", "--logger-fine-clock"}));
     EXPECT_NE(a.host_init_pid(), b.host_init_pid());
     std::string out;
     EXPECT_EQ(7, a.exec({"sh", "-c", "getprop ro.build.type; getprop no.such.prop fallback; setprop debug.emu.a 42; "
@@ -51,6 +61,9 @@ TEST(Emulator, TwoPhonesRunTheirToolsWithTheirOwnOptionsAndDoNotSeeEachOther) {
     b.exec({"sh", "-c", "t=$(printf %2990s | tr ' ' x); log $t && log $t && "
                         "dd if=/dev/log/main of=/dev/null bs=5120 iflag=nonblock 2>&1"}, &out);
     EXPECT_TRUE(contains(out, "3016 bytes")) << out;
+    ASSERT_EQ(0, a.exec({"log", "tick"}));
+    EXPECT_EQ(0, first_entry_nsec(a) % 10000000);
+    EXPECT_GT(first_entry_nsec(b) % 10000000, 0);
 }
 
 TEST(Emulator, DaemonRestartsRebootKeepsPersistentStateAndPowerOffLeavesNothing) {
