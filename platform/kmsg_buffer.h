@@ -35,7 +35,8 @@ class KmsgBuffer {
   private:
     void store(const char* text, size_t len);
     size_t record_len(uint64_t pos) const;
-    void copy_out(uint64_t pos, char* dst, size_t n) const;
+    void copy_in(uint64_t pos, const void* src, size_t n);
+    void copy_out(uint64_t pos, void* dst, size_t n) const;
 
     // Records as a 2-byte length and the text, oldest at head_; positions are
     // byte counts since the start, taken modulo the buffer's size.
