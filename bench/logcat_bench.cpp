@@ -412,7 +412,9 @@ pid_t start_logger_devices(const char* size_bytes) {
         kill(old, SIGTERM);
         while (kill(old, 0) == 0) usleep(1000);
     }
-    std::string command = std::string("emu_logger --size ") + size_bytes + " /dev/log";
+    // Stamps to the nanosecond: (e) checks the entries, alternating between
+    // main and system, in the order written, which equal stamps would not keep.
+    std::string command = std::string("emu_logger --fine-clock --size ") + size_bytes + " /dev/log";
     return system(command.c_str()) == 0 ? pid_named("emu_logger") : -1;
 }
 

@@ -4,8 +4,9 @@
 // stored persist. properties, and keeps the daemon running: it starts
 // /system/bin/tavlo_log_d as root, restarts it when it ends (no sooner than
 // 5 s after its previous start, as a phone's init), and reaps every orphan.
-// Before the daemon it starts the phone's logger devices at /dev/log and the
-// Bluetooth stack's log service (unless the boot left them out). SIGTERM
+// Before the daemon it starts the kernel log at /proc/kmsg, the phone's logger
+// devices at /dev/log and the Bluetooth stack's log service (unless the boot
+// left them out). SIGTERM
 // powers the phone off.
 #include <dirent.h>
 #include <errno.h>
@@ -232,22 +233,6 @@ static void load_persistent_properties() {
     closedir(dir);
 }
 
-// The kernel-log stand-in is a FIFO bound over /proc/kmsg. Holding it open for
-// writing means its readers never see end of file, as with the real file, and
-// lets the host write into it without waiting for a reader. The larger pipe
-// buffer holds a burst of host lines while no collector reads.
-static int hold_kmsg() {
-    struct stat st;
-    if (stat("/proc/kmsg", &st) != 0 || !S_ISFIFO(st.st_mode)) return -1;
-    int fd = TEMP_FAILURE_RETRY(open("/proc/kmsg", O_RDWR | O_NONBLOCK | O_CLOEXEC));
-    if (fd < 0) {
-        init_log("cannot hold /proc/kmsg: %s", strerror(errno));
-        return -1;
-    }
-    fcntl(fd, F_SETPIPE_SZ, 1 << 20);
-    return fd;
-}
-
 // The engineering storage tool of the kelm boot, run in the background with
 // the steps tavlo-emu left (e.g. "after 3 link"), when it left any.
 static void start_ext_sdcard_tool(const sigset_t* old_mask) {
@@ -292,8 +277,18 @@ static bool boot_flag(const char* name) {
     return value != nullptr && strcmp(value, "1") == 0;
 }
 
+// The kernel log: /proc/kmsg served as the kernel serves it (emu_kmsg), fed
+// by the host through /dev/emu/kmsg; a boot with EMU_REAL_KMSG=1 keeps the
+// host kernel's own.
+static void start_kernel_log() {
+    if (boot_flag("EMU_REAL_KMSG")) return;
+    const char* const argv[] = {"/system/bin/emu_kmsg", "/dev/emu/kmsg", "/proc/kmsg", nullptr};
+    if (run_tool(argv) != 0) init_log("the kernel log does not serve (see console.log)");
+}
+
 // The logger devices, each of EMU_LOGGER_SIZE bytes (default 256 KiB), without
-// /dev/log/system when EMU_NO_SYSTEM_LOG=1. emu_logger returns once they serve.
+// /dev/log/system when EMU_NO_SYSTEM_LOG=1, stamping entries to the nanosecond
+// when EMU_LOGGER_FINE_CLOCK=1. emu_logger returns once they serve.
 static void start_logger_devices() {
     prepare_dir("/dev/log", 0755, AID_ROOT, AID_ROOT);
     const char* size = getenv("EMU_LOGGER_SIZE");
@@ -304,6 +299,7 @@ static void start_logger_devices() {
         argv[argc++] = size;
     }
     if (boot_flag("EMU_NO_SYSTEM_LOG")) argv[argc++] = "--no-system";
+    if (boot_flag("EMU_LOGGER_FINE_CLOCK")) argv[argc++] = "--fine-clock";
     argv[argc++] = "/dev/log";
     argv[argc] = nullptr;
     if (run_tool(argv) != 0) init_log("the logger devices do not serve (see console.log)");
@@ -420,8 +416,7 @@ int main() {
     prepare_folders();
     load_build_prop("/system/build.prop");
     load_persistent_properties();
-    int kmsg_fd = hold_kmsg();
-    (void)kmsg_fd;  // held until power-off
+    start_kernel_log();
     int btlog_fd = hold_btlog_feed();
     (void)btlog_fd;  // held until power-off
     start_logger_devices();

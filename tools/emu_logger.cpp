@@ -2,14 +2,15 @@
 // FUSE) mounted at /dev/log that behaves as the phone's legacy logger driver.
 // "main", "system", "radio" and "events" each hold one ring of whole entries
 // (platform/logger_ring.h). Every write appends one entry stamped with the
-// writer's pid and tid (as seen inside the phone) and the time; every open for
+// writer's pid and tid (as seen inside the phone) and the time (to the 10-ms
+// tick as on the phone, to the nanosecond with --fine-clock); every open for
 // reading has its own position, starting at the oldest kept entry; a read
 // hands over exactly one entry (EINVAL when the buffer is too small for it),
 // waits for one when there is none (EAGAIN with O_NONBLOCK); poll reports
 // readable exactly while unread entries exist. ".inject" (root only) appends
 // an entry with a header of the writer's choice.
 //
-//   emu_logger [--size BYTES] [--no-system] [-f] MOUNTPOINT
+//   emu_logger [--size BYTES] [--no-system] [--fine-clock] [-f] MOUNTPOINT
 //
 // Returns once the devices serve (exit 0) and goes on in the background; -f
 // keeps it in the foreground. SIGTERM unmounts and ends it.
@@ -38,6 +39,7 @@ constexpr gid_t AID_LOG = 1007;
 constexpr fuse_ino_t INJECT_INO = 2 + LOGGER_BUFFER_COUNT;
 constexpr double CACHE_SECONDS = 3600;  // the tree never changes while mounted
 constexpr int MAX_READERS = 16384;       // bounds what openers can make us hold (48 bytes each)
+constexpr long TICK_NS = 10000000;
 
 // One open for reading; the descriptor's file handle points at it.
 struct Reader {
@@ -63,6 +65,7 @@ Reader* g_readers[LOGGER_BUFFER_COUNT];
 int g_reader_count = 0;
 PendingRead* g_pending = nullptr;
 struct timespec g_mount_time;
+bool g_fine_clock = false;  // stamps to the nanosecond instead of the tick
 
 int buffer_of(fuse_ino_t ino) {
     int buffer = static_cast<int>(ino) - 2;
@@ -191,6 +194,16 @@ void wake_readers(int buffer) {
             r->poll = nullptr;
         }
     }
+}
+
+// The phone's driver stamps an entry with the kernel's coarse clock, the time
+// of the last scheduler tick: entries written within one tick, in any buffer,
+// carry equal stamps. Ticks here are 10 ms (a kernel with HZ=100).
+struct timespec write_time() {
+    struct timespec now;
+    clock_gettime(g_fine_clock ? CLOCK_REALTIME : CLOCK_REALTIME_COARSE, &now);
+    if (!g_fine_clock) now.tv_nsec -= now.tv_nsec % TICK_NS;
+    return now;
 }
 
 void op_lookup(fuse_req_t req, fuse_ino_t parent, const char* name) {
@@ -327,8 +340,7 @@ void op_write(fuse_req_t req, fuse_ino_t ino, const char* buf, size_t size, off_
         // pid 0: a writer outside the phone (the host through its root).
         int32_t tid = ctx->pid;
         int32_t pid = tid > 0 ? pid_of_writer(tid) : 0;
-        struct timespec now;
-        clock_gettime(CLOCK_REALTIME, &now);
+        struct timespec now = write_time();
         size_t kept = logger_device_write(g_present[buffer], pid, tid, now, buf, size);
         if (kept > 0) wake_readers(buffer);
         fuse_reply_write(req, kept);
@@ -383,7 +395,7 @@ void release_all() {
 }
 
 int usage() {
-    fprintf(stderr, "usage: emu_logger [--size BYTES] [--no-system] [-f] MOUNTPOINT\n");
+    fprintf(stderr, "usage: emu_logger [--size BYTES] [--no-system] [--fine-clock] [-f] MOUNTPOINT\n");
     return 2;
 }
 
@@ -406,6 +418,8 @@ int main(int argc, char** argv) {
             size = static_cast<size_t>(n);
         } else if (strcmp(argv[i], "--no-system") == 0) {
             with_system = false;
+        } else if (strcmp(argv[i], "--fine-clock") == 0) {
+            g_fine_clock = true;
         } else if (strcmp(argv[i], "-f") == 0) {
             foreground = true;
         } else if (argv[i][0] != '-' && mountpoint == nullptr) {

@@ -1,8 +1,9 @@
 // The emulated phone itself: its tools, boot options and isolation, restart,
-// reboot and power-off, the kernel-log FIFO and the rights of the daemon's identity.
+// reboot and power-off, the kernel log and the rights of the daemon's identity.
 #include <dirent.h>
 #include <limits.h>
 #include <signal.h>
+#include <stdlib.h>
 #include <unistd.h>
 
 #include <fstream>
@@ -12,10 +13,10 @@
 
 namespace {
 
-// The daemon's identity after start-up.
+// The daemon's identity after start-up, which keeps CAP_SYSLOG for the kernel log.
 std::vector<std::string> as_daemon(const std::string& command) {
     return {"setpriv", "--reuid", "2000", "--regid", "1000", "--groups", "1000,1001,1007,1015,9998,2001,1028,1023",
-            "--", "sh", "-c", command};
+            "--inh-caps", "+syslog", "--ambient-caps", "+syslog", "--", "sh", "-c", command};
 }
 
 std::string read_link(const std::string& path) {
@@ -33,12 +34,21 @@ int processes_in_pid_namespace(const std::string& ns_link) {
     return n;
 }
 
+// The nanoseconds of the oldest entry of /dev/log/main (-1 when none).
+long first_entry_nsec(EmuPhone& phone) {
+    std::string out;
+    phone.exec({"sh", "-c", "dd if=/dev/log/main bs=5120 count=1 iflag=nonblock 2>/dev/null | od -An -tu4 -j16 -N4"}, &out);
+    return out.empty() ? -1 : atol(out.c_str());
+}
+
 // The phone with the default options has the system log and the Bluetooth
-// service; the other has neither, and does not see the first one's socket.
+// service, and stamps log entries to the phone kernel's 10-ms tick; the other
+// has neither service, stamps to the nanosecond, and does not see the first
+// one's socket.
 TEST(Emulator, TwoPhonesRunTheirToolsWithTheirOwnOptionsAndDoNotSeeEachOther) {
     EmuPhone a, b;
     ASSERT_TRUE(a.boot());
-    ASSERT_TRUE(b.boot({"--no-system-log", "--no-btlog", "--logger-size", "4"}));
+    ASSERT_TRUE(b.boot({"--no-system-log", "--no-btlog", "--logger-size", "4", "--logger-fine-clock"}));
     EXPECT_NE(a.host_init_pid(), b.host_init_pid());
     std::string out;
     EXPECT_EQ(7, a.exec({"sh", "-c", "getprop ro.build.type; getprop no.such.prop fallback; setprop debug.emu.a 42; "
@@ -51,6 +61,9 @@ TEST(Emulator, TwoPhonesRunTheirToolsWithTheirOwnOptionsAndDoNotSeeEachOther) {
     b.exec({"sh", "-c", "t=$(printf %2990s | tr ' ' x); log $t && log $t && "
                         "dd if=/dev/log/main of=/dev/null bs=5120 iflag=nonblock 2>&1"}, &out);
     EXPECT_TRUE(contains(out, "3016 bytes")) << out;
+    ASSERT_EQ(0, a.exec({"log", "tick"}));
+    EXPECT_EQ(0, first_entry_nsec(a) % 10000000);
+    EXPECT_GT(first_entry_nsec(b) % 10000000, 0);
 }
 
 TEST(Emulator, DaemonRestartsRebootKeepsPersistentStateAndPowerOffLeavesNothing) {
@@ -89,15 +102,20 @@ TEST(Emulator, DaemonRestartsRebootKeepsPersistentStateAndPowerOffLeavesNothing)
     EXPECT_NE(0, phone.exec({"true"}));
 }
 
-TEST(Emulator, KmsgCarriesHostBytesAndTheDaemonsIdentityWritesOnlyWhereItMust) {
+TEST(Emulator, KmsgHandsOutWholeLinesAndTheDaemonsIdentityReachesOnlyWhatItMust) {
     EmuPhone phone;
     ASSERT_TRUE(phone.boot());
     std::string out;
     EXPECT_EQ(0, phone.exec({"stat", "-c", "%F %a %u %g", "/proc/kmsg"}, &out));
-    EXPECT_EQ("fifo 440 0 1007\n", out);
-    ASSERT_TRUE(phone.feed("kmsg", "<6>[    1.000000] first line\n"));
-    EXPECT_EQ(0, phone.exec(as_daemon("head -c 29 /proc/kmsg"), &out));
-    EXPECT_EQ("<6>[    1.000000] first line\n", out);
+    EXPECT_EQ("regular empty file 440 0 1000\n", out);
+    // Reads of 255 bytes, as the kernel collector's, each by a reader of its
+    // own: whole lines while they fit, a longer line in pieces, and what one
+    // reader took no other sees.
+    const std::string a = "<6>" + std::string(96, 'a') + "\n";
+    ASSERT_TRUE(phone.feed("kmsg", a + a + a + "<6>" + std::string(296, 'b') + "\n<6>end of lines\n"));
+    EXPECT_EQ(0, phone.exec(as_daemon("for i in 1 2 3 4; do dd if=/proc/kmsg bs=255 count=1 2>/dev/null | wc -c; done; "
+                                      "dd if=/proc/kmsg bs=255 count=1 iflag=nonblock 2>&1 | grep -c unavailable"), &out));
+    EXPECT_EQ("200\n100\n255\n61\n1\n", out);
     // More than a pipe holds goes in without a reader, unchanged.
     std::string burst;
     for (int i = 0; burst.size() < 200000; i++) burst += "<6>line " + std::to_string(i) + "\n";
@@ -120,6 +138,8 @@ TEST(Emulator, KmsgCarriesHostBytesAndTheDaemonsIdentityWritesOnlyWhereItMust) {
         {"ls /data/property", false},
         {"touch /system/etc/probe", false},
         {"echo 1 > /sys/class/BOOT/BOOT/boot/boot_mode", false},
+        {"exec 3</proc/kmsg", true},
+        {"setpriv --ambient-caps -syslog -- sh -c 'exec 3</proc/kmsg'", false},  // without CAP_SYSLOG
     };
     ASSERT_EQ(0, phone.exec({"setprop", "debug.emu.by_root", "root"}));
     for (const auto& c : cases) EXPECT_EQ(c.allowed, phone.exec(as_daemon(c.command)) == 0) << c.command;

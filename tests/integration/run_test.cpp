@@ -32,10 +32,12 @@ SCENARIOS(Run, {
     {"KernelLogHoldsTheHeaderAndExactlyTheBytesWritten", {}, {},
      {{"ctl", "start"}, {"kmsg", odd_bytes()}, {"has", "$RUN/kernel_log", "at the end"}, {"ctl", "stop"},
       {"is", "$RUN/kernel_log", H + odd_bytes()}}},
+    // The last line written can fill a file: it then ends kernel_log.1.
     {"RotationKeepsFiveGenerations", {}, {},
      {{"ctl", "AndroidLog=0 BTLog=0 logsize=1 start"}, {"prop", "debug.TQ.logsize", "204"}, {"kmsg", kRotation},
-      {"has", "$RUN/kernel_log", kRotation.substr(kRotation.size() - 64)}, {"ctl", "stop"},
-      {"has", "$RUN/kernel_log.4", H}, {"gone", "$RUN/kernel_log.5"}}},
+      {"sh", "cd $(getprop debug.TQ.realpath) && until cat kernel_log.1 kernel_log 2>/dev/null | grep -qxF '" +
+                 kRotation.substr(kRotation.size() - 64, 63) + "'; do sleep 0.05; done; echo in", "in\n"},
+      {"ctl", "stop"}, {"has", "$RUN/kernel_log.4", H}, {"gone", "$RUN/kernel_log.5"}}},
     // Killed from outside, a collector leaves no reason and no warning is
     // given; asked to stop by its own signal, it leaves reason 0, which is.
     {"CollectorDeathStopsTheRunAndTellsEveryClient", {}, {},
@@ -134,9 +136,10 @@ TEST(LogRun, StopInASteadyStreamLosesAndRepeatsNothing) {
     EXPECT_EQ(0, stream.compare(0, first_body.size(), first_body));
     EXPECT_GE(first_body.size(), sent_before_stop);
 
-    // The rest waits in the kernel log for the next run. A FIFO (unlike the
-    // kernel's log) ends a read anywhere: the first file may end inside a line
-    // that the next one completes. In the same second the next run reuses the folder.
+    // Each read of the kernel log is whole lines, so the first file ends at a
+    // line's end; the rest waits in the kernel log for the next run. In the
+    // same second the next run reuses the folder.
+    EXPECT_TRUE(!first_body.empty() && first_body.back() == '\n') << "the first file ends inside a line";
     ASSERT_TRUE(ctl(phone, "start"));
     std::string second = run_folder(phone) + "kernel_log";
     size_t skip = second == first ? first_file.size() : 0;
