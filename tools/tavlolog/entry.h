@@ -26,8 +26,11 @@ enum Kind : uint8_t {
 };
 
 struct Entry {
-    int64_t instant_ns;     // nanoseconds since the epoch (UTC); since boot when !has_instant
-    bool has_instant;       // false: a kernel line of a run that lacks its boot's wall-clock time
+    int64_t instant_ns;     // nanoseconds since the epoch (UTC) when has_instant
+    // false: a kernel line of a run that lacks its boot's wall-clock time (then
+    // uptime_ns holds its time since boot), Bluetooth bytes, and a marker or
+    // note before its file's first timed line
+    bool has_instant;
     int32_t utc_offset_s;   // the zone offset of the line's local time (RFC 3339 output)
     Source source;
     Kind kind;
