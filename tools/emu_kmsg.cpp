@@ -75,9 +75,9 @@ long long now_ms() {
 bool may_read_kernel_log(pid_t tid) {
     char path[48];
     snprintf(path, sizeof(path), "/proc/%d/status", static_cast<int>(tid));
-    UniqueFd fd(RETRY_EINTR(open(path, O_RDONLY | O_CLOEXEC)));
+    UniqueFd fd(TEMP_FAILURE_RETRY(open(path, O_RDONLY | O_CLOEXEC)));
     char text[2048];
-    ssize_t n = fd.ok() ? RETRY_EINTR(read(fd.get(), text, sizeof(text) - 1)) : -1;
+    ssize_t n = fd.ok() ? TEMP_FAILURE_RETRY(read(fd.get(), text, sizeof(text) - 1)) : -1;
     if (n <= 0) return false;
     text[n] = '\0';
     const char* at = strstr(text, "\nCapEff:");
@@ -318,7 +318,7 @@ int main(int argc, char** argv) {
     // Held open for writing too, the FIFO never shows us an end, and the host
     // can write into it whether or not we read. The larger buffer holds a
     // burst of the host's lines while the log is full.
-    UniqueFd feed(RETRY_EINTR(open(paths[0], O_RDWR | O_NONBLOCK | O_CLOEXEC)));
+    UniqueFd feed(TEMP_FAILURE_RETRY(open(paths[0], O_RDWR | O_NONBLOCK | O_CLOEXEC)));
     if (!feed.ok()) {
         fprintf(stderr, "emu_kmsg: cannot open %s: %s\n", paths[0], strerror(errno));
         return 1;
@@ -336,7 +336,7 @@ int main(int argc, char** argv) {
         if (pid > 0) {
             close(ready[1]);
             char ok = 0;
-            return RETRY_EINTR(read(ready[0], &ok, 1)) == 1 && ok == 1 ? 0 : 1;
+            return TEMP_FAILURE_RETRY(read(ready[0], &ok, 1)) == 1 && ok == 1 ? 0 : 1;
         }
         close(ready[0]);
         setsid();
