@@ -17,6 +17,10 @@ constexpr char SOURCE_LETTER[SRC_COUNT + 1] = "KMSREB";
 constexpr int PRIO_VERBOSE = 8;
 constexpr int PRIO_NONE = -1;  // Bluetooth bytes, markers and notes carry none
 
+// Nanoseconds since the epoch (or since boot) fit 64 bits up to the year 2262:
+// a time of more seconds, from a damaged file or folder name, gives no instant.
+constexpr int64_t MAX_TIME_S = 9000000000;
+
 enum Kind : uint8_t {
     KIND_LINE,       // a parsed log line
     KIND_MARKER,     // "--------- beginning of ..."

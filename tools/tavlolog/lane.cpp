@@ -351,6 +351,12 @@ void Lane::android_entry(const ParsedLine& p) {
     }
     int64_t local = cached_days_ * 86400 + p.hour * 3600 + p.minute * 60 + p.second;
     int32_t off = zone_->offset_of_local(local);
+    if (local - off >= MAX_TIME_S || local - off <= -MAX_TIME_S) {
+        // A year no instant can hold (a damaged folder name): shown as it is.
+        entry_.kind = KIND_MALFORMED;
+        inherit();
+        return;
+    }
     entry_.instant_ns = (local - off) * 1000000000 + p.nanos;
     entry_.has_instant = true;
     entry_.utc_offset_s = off;
@@ -377,9 +383,11 @@ void Lane::kernel_entry(const ParsedLine& p) {
         entry_.has_instant = false;
         entry_.instant_ns = p.uptime_ns;
         entry_.utc_offset_s = 0;
+    } else if (__builtin_add_overflow(context_->boot_wallclock_ns, p.uptime_ns, &entry_.instant_ns)) {
+        inherit();
+        return;
     } else {
         entry_.has_instant = true;
-        entry_.instant_ns = context_->boot_wallclock_ns + p.uptime_ns;
         entry_.utc_offset_s = zone_->offset_of_instant(floor_div(entry_.instant_ns, 1000000000));
     }
     key_ = entry_.instant_ns;

@@ -151,7 +151,7 @@ bool parse_kernel(std::string_view line, ParsedLine* out) {
         if (sd > 0 && q < end && *q == '.') {
             for (q++; q < end && digit(*q) && fd < 9; q++, fd++) frac = frac * 10 + (*q - '0');
         }
-        if (sd > 0 && fd > 0 && q < end && *q == ']') {
+        if (sd > 0 && fd > 0 && q < end && *q == ']' && secs < MAX_TIME_S) {
             for (int i = fd; i < 9; i++) frac *= 10;
             out->uptime_ns = secs * 1000000000 + frac;
             p = q + 1;

@@ -146,7 +146,7 @@ bool parse_wallclock(const std::string& text, int64_t* ns) {
         for (i++; i < text.size() && text[i] >= '0' && text[i] <= '9' && digits < 9; i++, digits++)
             frac = frac * 10 + (text[i] - '0');
     }
-    if (i != text.size()) return false;
+    if (i != text.size() || secs >= MAX_TIME_S) return false;
     for (; digits < 9; digits++) frac *= 10;
     *ns = secs * 1000000000 + frac;
     return true;
