@@ -1,8 +1,9 @@
 #!/usr/bin/env bash
 # Builds everything and runs every test.
 #
-#   tools/test.sh [--arm] [--sanitize] [--skip-wait|--only-wait]
+#   tools/test.sh [--arm] [--sanitize] [--skip-wait|--only-wait] [--build-only]
 #
+# --build-only builds and runs nothing (CI builds the next suite while one runs).
 # --sanitize: the same tests built with AddressSanitizer and
 # UndefinedBehaviorSanitizer. --arm: built for the phone's 32-bit ARM
 # processor and run under qemu (daemon, phone, tools and tests alike).
@@ -19,16 +20,18 @@
 set -eu
 cd "$(dirname "$0")/.."
 readonly wait_test='/Boot\.Runs/NoClientForFiveMinutesCopiesTheBootLogs( |$)'
-usage() { echo "usage: $0 [--arm] [--sanitize] [--skip-wait|--only-wait]" >&2; exit 2; }
+usage() { echo "usage: $0 [--arm] [--sanitize] [--skip-wait|--only-wait] [--build-only]" >&2; exit 2; }
 arm=0
 sanitize=0
 wait=run
+build_only=0
 for arg in "$@"; do
     case $arg in
         --arm) arm=1 ;;
         --sanitize) sanitize=1 ;;
         --skip-wait) wait=skip ;;
         --only-wait) wait=only ;;
+        --build-only) build_only=1 ;;
         *) usage ;;
     esac
 done
@@ -60,11 +63,12 @@ if [ $sanitize = 1 ]; then
 fi
 browser=ON
 [ $arm = 0 ] && [ $sanitize = 0 ] || browser=OFF
-extra+=(-DTAVLO_BROWSER_TESTS=$browser)
+extra+=(-DTAVLO_BROWSER_TESTS=$browser -DTAVLO_BENCHMARKS=$browser)
 jobs=$(nproc)
 tools/check-layers.sh
 cmake -S . -B "$build" -G Ninja "${extra[@]}" >/dev/null
 cmake --build "$build" -j"$jobs"
+[ $build_only = 0 ] || exit 0
 # The tests mostly wait (phones booting, the daemon's one-second writer, its
 # timers), so twice as many as there are processors run at once.
 ctest --test-dir "$build" --output-on-failure -j$((2 * jobs)) "${select[@]}"
